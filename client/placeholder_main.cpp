@@ -1,0 +1,2 @@
+// Placeholder until the client tool lands.
+int main() { return 1; }

@@ -1,0 +1,127 @@
+// Log stand-in: one line per call on standard error, optionally mirrored to the
+// systemd journal with structured fields, and to a test sink.
+#include "dlog.h"
+
+#include <sys/stat.h>
+#include <systemd/sd-journal.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <mutex>
+#include <string>
+
+namespace {
+
+std::mutex g_sink_mutex;
+dlog_sink_fn g_sink = nullptr;
+void* g_sink_user = nullptr;
+std::atomic<bool> g_quiet{false};
+
+char priority_letter(int prio) {
+  switch (prio) {
+    case DLOG_INFO:
+      return 'I';
+    case DLOG_WARN:
+      return 'W';
+    default:
+      return 'E';
+  }
+}
+
+int journal_priority(int prio) {
+  switch (prio) {
+    case DLOG_INFO:
+      return 6;  // LOG_INFO
+    case DLOG_WARN:
+      return 4;  // LOG_WARNING
+    default:
+      return 3;  // LOG_ERR
+  }
+}
+
+// systemd sets JOURNAL_STREAM to "<dev>:<ino>" of the stream it connected to
+// standard error; only when that is still our stderr do we talk to the journal.
+bool stderr_is_journal() {
+  const char* env = std::getenv("JOURNAL_STREAM");
+  if (env == nullptr) return false;
+  unsigned long long dev = 0, ino = 0;
+  if (std::sscanf(env, "%llu:%llu", &dev, &ino) != 2) return false;
+  struct stat st {};
+  if (fstat(STDERR_FILENO, &st) != 0) return false;
+  return st.st_dev == dev && st.st_ino == ino;
+}
+
+// The service formats lines as "file: function(line) > message"; pull the three
+// code fields back out for the journal.
+void send_to_journal(int prio, const char* tag, const std::string& text) {
+  std::string file, func, line;
+  size_t colon = text.find(": ");
+  size_t paren = colon == std::string::npos ? std::string::npos : text.find('(', colon);
+  size_t close = paren == std::string::npos ? std::string::npos : text.find(") > ", paren);
+  if (close != std::string::npos) {
+    file = text.substr(0, colon);
+    func = text.substr(colon + 2, paren - colon - 2);
+    line = text.substr(paren + 1, close - paren - 1);
+  }
+  (void)sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journal_priority(prio),
+                        "SYSLOG_IDENTIFIER=%s", tag, "CODE_FILE=%s", file.c_str(),
+                        "CODE_LINE=%s", line.c_str(), "CODE_FUNC=%s", func.c_str(), nullptr);
+}
+
+}  // namespace
+
+int __dlog_print(log_id_t /*log_id*/, int prio, const char* tag, const char* fmt, ...) {
+  if (tag == nullptr || fmt == nullptr) return -1;
+  va_list ap;
+  va_start(ap, fmt);
+  char stack_buffer[1024];
+  va_list copy;
+  va_copy(copy, ap);
+  int needed = std::vsnprintf(stack_buffer, sizeof stack_buffer, fmt, copy);
+  va_end(copy);
+  std::string text;
+  if (needed < 0) {
+    va_end(ap);
+    return -1;
+  }
+  if (static_cast<size_t>(needed) < sizeof stack_buffer) {
+    text.assign(stack_buffer, static_cast<size_t>(needed));
+  } else {
+    text.resize(static_cast<size_t>(needed) + 1);
+    std::vsnprintf(text.data(), text.size(), fmt, ap);
+    text.resize(static_cast<size_t>(needed));
+  }
+  va_end(ap);
+  // A message's own line feed ends the line; it must not add a blank one.
+  if (!text.empty() && text.back() == '\n') text.pop_back();
+
+  if (!g_quiet.load(std::memory_order_relaxed)) {
+    std::string line;
+    line.reserve(text.size() + std::strlen(tag) + 5);
+    line += priority_letter(prio);
+    line += '/';
+    line += tag;
+    line += ": ";
+    line += text;
+    line += '\n';
+    // One write per line keeps lines of the two threads from interleaving.
+    (void)!write(STDERR_FILENO, line.data(), line.size());
+    static const bool journal = stderr_is_journal();
+    if (journal) send_to_journal(prio, tag, text);
+  }
+
+  std::lock_guard<std::mutex> guard(g_sink_mutex);
+  if (g_sink != nullptr) g_sink(prio, tag, text.c_str(), g_sink_user);
+  return 0;
+}
+
+void dlog_set_sink(dlog_sink_fn sink, void* user) {
+  std::lock_guard<std::mutex> guard(g_sink_mutex);
+  g_sink = sink;
+  g_sink_user = user;
+}
+
+void dlog_set_quiet(bool quiet) { g_quiet.store(quiet, std::memory_order_relaxed); }

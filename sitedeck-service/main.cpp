@@ -1,0 +1,2 @@
+// Placeholder until the service spine lands.
+int main() { return 1; }
