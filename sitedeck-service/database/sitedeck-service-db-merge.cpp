@@ -1,0 +1,131 @@
+// The merge of a downloaded item list into the table: new sites are inserted,
+// stored ones refreshed, all numbered in list order with their specially
+// removed state, new icons stored, and live sites the list no longer names
+// deleted. The whole merge is one transaction, so neither a reader in another
+// process nor a crash ever sees a half-merged table; within it, one item's
+// failing step does not stop the others.
+#include <sqlite3.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <new>
+#include <string_view>
+#include <unordered_set>
+
+#include "database/sitedeck-service-db-interface.h"
+#include "sitedeck-service-ipc.h"
+#include "sitedeck-service-log.h"
+#include "sitedeck-service-raii.h"
+
+namespace {
+
+using UrlSet = std::unordered_set<std::string_view>;
+
+bool run(const char* sql) {
+  if (sqlite3_exec(sds_db_handle, sql, nullptr, nullptr, nullptr) == SQLITE_OK) return true;
+  SDS_LOGE("%s failed: %s", sql, sqlite3_errmsg(sds_db_handle));
+  return false;
+}
+
+// Pass 1 for one item: insert or refresh its row. `order` is its number.
+void merge_item(sds_item* item, int order) {
+  if (item->site_name == nullptr || item->site_name[0] == '\0') {
+    std::free(item->site_name);
+    item->site_name = strdup(item->site_url);
+  }
+  int code = SDS_ERROR_NONE;
+  int id = sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
+  if (id < 0) {
+    id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
+    (void)update_sitedeck_icon_to_db(id, item);
+    (void)update_sitedeck_order_index_to_db(id, &order);
+    (void)update_sitedeck_is_specially_removed(id, item->is_specially_removed);
+  } else {
+    (void)update_sitedeck_icon_to_db(id, item);
+    (void)update_sitedeck_order_index_to_db(id, &order);
+    (void)update_sitedeck_title_to_db(id, item->site_name);
+    if (item->predominant_color != nullptr) {
+      (void)update_sitedeck_predominant_color_to_db(id, item->predominant_color);
+    }
+    (void)update_sitedeck_is_specially_removed(id, item->is_specially_removed);
+  }
+  if (code != SDS_ERROR_NONE) SDS_LOGE("Error :: %s", sds_error_string(code));
+}
+
+// Collects the listed URLs; false when memory ran out.
+bool collect_urls(const sds_item* head, UrlSet* urls) {
+  try {
+    for (const sds_item* item = head; item != nullptr; item = item->next) {
+      if (item->site_url != nullptr) urls->insert(item->site_url);
+    }
+    return true;
+  } catch (const std::bad_alloc&) {
+    return false;
+  }
+}
+
+// Pass 2: deletes the live rows whose URL the list does not name. Returns
+// SDS_ERROR_NONE, or the code of the failed id list (SDS_ERROR_NO_DATA when
+// no row is live).
+int delete_vanished(const sds_item* head) {
+  UrlSet listed;
+  if (!collect_urls(head, &listed)) {
+    SDS_LOGE("failed to malloc");
+    return SDS_ERROR_OUT_OF_MEMORY;
+  }
+  int* raw_ids = nullptr;
+  int count = 0;
+  int live = 1;
+  int code = SDS_ERROR_NONE;
+  (void)sds_db_get_all_dirty_ids(sds_db_handle, &raw_ids, &count, "is_dirty", &live,
+                                 SDS_DB_COND_TYPE_INT, &code);
+  UniqueMalloc<int> ids(raw_ids);
+  if (code != SDS_ERROR_NONE) {
+    SDS_LOGE("Error : %d", code);
+    return code;
+  }
+  for (int i = 0; i < count; ++i) {
+    char* raw_url = nullptr;
+    if (get_sitedeck_url_from_db(ids.get()[i], &raw_url) != SDS_ERROR_NONE) {
+      std::free(raw_url);
+      continue;
+    }
+    UniqueCStr url(raw_url);
+    if (!url || url.get()[0] == '\0' || listed.contains(url.get())) continue;
+    if (delete_sitedeck_item_from_db(url.get()) != 0) SDS_LOGE("Not able to delete one URL");
+  }
+  return SDS_ERROR_NONE;
+}
+
+}  // namespace
+
+int insert_sitedeck_items_in_db(sds_item* head) {
+  // An empty list would make pass 2 delete every live site.
+  if (head == nullptr) {
+    SDS_LOGE("NULL check::item");
+    return -1;
+  }
+  if (!run("BEGIN IMMEDIATE")) return -1;
+
+  int order = 1;
+  for (sds_item* item = head; item != nullptr; item = item->next) {
+    if (item->site_url == nullptr || item->site_url[0] == '\0') continue;
+    merge_item(item, order);
+    ++order;
+  }
+  int code = delete_vanished(head);
+
+  // SQLite rolls a transaction back by itself after some errors (a full disk,
+  // an I/O error); then there is nothing left to commit.
+  if (sqlite3_get_autocommit(sds_db_handle) != 0) {
+    SDS_LOGE("merge transaction was rolled back");
+    return -1;
+  }
+  // With no live row there is nothing to clean up and the merge is whole,
+  // though it answers -1. Any other failed clean-up would leave vanished
+  // sites live beside the new numbering: keep the previous table instead.
+  bool keep = code == SDS_ERROR_NONE || code == SDS_ERROR_NO_DATA;
+  if (keep && run("COMMIT")) return code == SDS_ERROR_NONE ? 0 : -1;
+  (void)run("ROLLBACK");
+  return -1;
+}

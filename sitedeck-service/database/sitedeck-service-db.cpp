@@ -1,0 +1,179 @@
+// The item database file and its one connection: opening an existing file,
+// replacing a file that is not a database, creating a missing one with the
+// `site_deck` table, closing, finalizing statements and mapping SQLite
+// results to SDS codes. It never creates directories; the database directory
+// comes with the installation. The table layout is described in docs/storage.md.
+#include "database/sitedeck-service-db.h"
+
+#include <sqlite3.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "database/sitedeck-service-db-stmt.h"
+#include "sitedeck-service-log.h"
+#include "sitedeck-service-paths.h"
+
+namespace {
+
+constexpr const char* kCreateSiteDeckTable =
+    "CREATE TABLE IF NOT EXISTS site_deck(id INTEGER UNIQUE PRIMARY KEY,url TEXT DEFAULT "
+    "NULL,title TEXT DEFAULT NULL,favicon_exists  INTEGER DEFAULT 0,dominant_color TEXT DEFAULT "
+    "NULL,touch_icon_exists INTEGER DEFAULT 0,touchicon TEXT,is_dirty INTEGER DEFAULT "
+    "1,image_last_updated TEXT,icon_size TEXT,icon_path TEXT,icon_data BLOB,order_index INTEGER "
+    "DEFAULT 0,sync1 TEXT DEFAULT NULL,sync2 TEXT DEFAULT NULL,sync3 TEXT DEFAULT NULL,sync4 TEXT "
+    "DEFAULT NULL)";
+
+// Another process of the service (a second browser connection) may hold the
+// file for a moment; wait for it rather than fail at once.
+constexpr int kBusyTimeoutMs = 2000;
+
+// SQLite opens files lazily: a file that is not a database is only noticed
+// at the first statement. Reading the schema version makes that happen now.
+// Returns SQLITE_OK or the result of the failing call.
+int probe_database(sqlite3* db) {
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(db, "PRAGMA schema_version", -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  if (rc != SQLITE_OK) return rc;
+  rc = sqlite3_step(stmt.get());
+  return rc == SQLITE_ROW || rc == SQLITE_DONE ? SQLITE_OK : rc;
+}
+
+// Deletes a database file that can't be used, with its rollback journal, so
+// the fresh file does not inherit a stale journal.
+void delete_database_file(const char* path) {
+  (void)unlink(path);
+  std::string journal = std::string(path) + "-journal";
+  (void)unlink(journal.c_str());
+}
+
+}  // namespace
+
+int sds_db_open(sqlite3** handle) {
+  if (handle == nullptr) return -1;
+  std::string path = sds_path(SDS_DB_PATH);
+  int error_code = SDS_ERROR_NONE;
+  int result = __db_open(path.c_str(), handle, &error_code);
+  if (error_code != SDS_ERROR_NONE || *handle == nullptr) SDS_LOGE("errorcode : %d", error_code);
+  return result;
+}
+
+int __db_open(const char* path, sqlite3** handle, int* error_code) {
+  if (path == nullptr || handle == nullptr || error_code == nullptr) return -1;
+  sqlite3* db = nullptr;
+  int rc = sqlite3_open_v2(path, &db, SQLITE_OPEN_READWRITE, nullptr);
+  if (rc == SQLITE_OK) {
+    (void)sqlite3_busy_timeout(db, kBusyTimeoutMs);
+    rc = probe_database(db);
+    // Anything but a file that is no database (a busy lock, say) leaves the
+    // file as it is: it is a database and is used unchanged.
+    if (rc != SQLITE_NOTADB && rc != SQLITE_CORRUPT) {
+      *handle = db;
+      return 0;
+    }
+  } else {
+    rc = sqlite3_errcode(db);
+  }
+  SDS_LOGE("database open error(%d):%s", rc, sqlite3_errmsg(db));
+
+  if (rc == SQLITE_CORRUPT || rc == SQLITE_NOTADB) {
+    (void)sqlite3_close(db);
+    db = nullptr;
+    delete_database_file(path);
+    rc = SQLITE_CANTOPEN;
+  }
+  if (rc != SQLITE_CANTOPEN) {
+    SDS_LOGE("can not handle this error(%d):%s", rc, sqlite3_errmsg(db));
+    *error_code = SDS_ERROR_OUT_OF_MEMORY;
+    (void)sqlite3_close(db);
+    *handle = nullptr;
+    return -1;
+  }
+  (void)sqlite3_close(db);
+  db = nullptr;
+  *handle = nullptr;
+
+  rc = sqlite3_open(path, &db);
+  if (rc != SQLITE_OK) {
+    (void)unlink(path);
+    rc = sqlite3_errcode(db);
+    SDS_LOGE("database new error(%d):%s", rc, sqlite3_errmsg(db));
+    *error_code =
+        (rc == SQLITE_FULL || rc == SQLITE_CANTOPEN) ? SDS_ERROR_NO_SPACE : SDS_ERROR_DISK_BUSY;
+    (void)sqlite3_close(db);
+    *handle = nullptr;
+    return -1;
+  }
+  (void)sqlite3_busy_timeout(db, kBusyTimeoutMs);
+  // A table that can't be created shows later as failing statements.
+  (void)__rebuild_site_deck_tables(db);
+  *handle = db;
+  return 0;
+}
+
+int __rebuild_site_deck_tables(sqlite3* handle) {
+  if (__check_table(handle, "site_deck") == 0) return 0;
+  int rc = sqlite3_exec(handle, kCreateSiteDeckTable, nullptr, nullptr, nullptr);
+  if (rc != SQLITE_OK) {
+    SDS_LOGE("create tables:%d error:%s", rc, sqlite3_errmsg(handle));
+    return -1;
+  }
+  return 0;
+}
+
+int __check_table(sqlite3* handle, const char* table) {
+  if (handle == nullptr || table == nullptr) {
+    SDS_LOGE("check handle or table name");
+    return -1;
+  }
+  SqliteText query(
+      sqlite3_mprintf("SELECT name FROM sqlite_master WHERE type='table' AND name='%q'", table));
+  if (!query) {
+    SDS_LOGE("failed to make query statement");
+    return -1;
+  }
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(handle, query.get(), -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  if (rc != SQLITE_OK) {
+    SDS_LOGE("sqlite3_prepare:%s", sqlite3_errmsg(handle));
+    return -1;
+  }
+  return sqlite3_step(stmt.get()) == SQLITE_ROW ? 0 : -1;
+}
+
+void sds_db_close(sqlite3* handle) {
+  if (handle == nullptr) return;
+  if (sqlite3_exec(handle, "VACUUM;", nullptr, nullptr, nullptr) != SQLITE_OK) {
+    SDS_LOGE("sqlite3_exec failed");
+    return;
+  }
+  if (sqlite3_close(handle) != SQLITE_OK) SDS_LOGE("check sqlite close");
+}
+
+int sds_db_get_errorcode(sqlite3* handle) {
+  if (handle == nullptr) {
+    SDS_LOGE("check connection handle");
+    return SDS_ERROR_DISK_BUSY;
+  }
+  switch (sqlite3_errcode(handle)) {
+    case SQLITE_FULL:
+      SDS_LOGE("SQLITE_FULL-NO_SPACE");
+      return SDS_ERROR_NO_SPACE;
+    case SQLITE_TOOBIG:
+    case SQLITE_LOCKED:
+    case SQLITE_BUSY:
+      SDS_LOGE("DISK_BUSY %s", sqlite3_errmsg(handle));
+      return SDS_ERROR_DISK_BUSY;
+    default:
+      return SDS_ERROR_NONE;
+  }
+}
+
+void __db_finalize(sqlite3_stmt* stmt) {
+  if (stmt == nullptr) return;
+  // The connection must be taken before the statement is gone.
+  sqlite3* db = sqlite3_db_handle(stmt);
+  if (sqlite3_finalize(stmt) != SQLITE_OK) SDS_LOGE("sqlite3_finalize:%s", sqlite3_errmsg(db));
+}
