@@ -1,0 +1,322 @@
+// The generic row and column operations on a real database file.
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <string>
+
+#include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db.h"
+#include "support/db_session.h"
+#include "support/items.h"
+#include "support/log_capture.h"
+
+namespace {
+
+class DbRows : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_NE(sds_db_handle, nullptr);
+    // id 1: every kind of value the reads meet.
+    ASSERT_TRUE(db_.exec(
+        "INSERT INTO site_deck(id, url, title, dominant_color, icon_size, favicon_exists, "
+        "order_index, icon_data) VALUES (1, 'https://a.example/', NULL, '', '96x64', 1, 2.5, "
+        "x'0102')"));
+  }
+  DbSession db_;
+};
+
+char* const kUntouched = reinterpret_cast<char*>(0x1);
+
+struct TextRead {
+  const char* name;
+  int id;
+  const char* column;
+  int result;
+  int code;
+  const char* value;    // null: output untouched
+  const char* message;  // expected log line, or null for none
+};
+
+TEST_F(DbRows, TextReadsTellMissingRowsFromMissingValues) {
+  const TextRead cases[] = {
+      {"value", 1, "url", 0, SDS_ERROR_NONE, "https://a.example/", nullptr},
+      {"null value", 1, "title", 0, SDS_ERROR_NO_DATA, nullptr, "check column type:5"},
+      {"empty text", 1, "dominant_color", 0, SDS_ERROR_NO_DATA, nullptr, nullptr},
+      {"integer column", 1, "favicon_exists", 0, SDS_ERROR_NO_DATA, nullptr, "check column type:1"},
+      {"unknown id", 99, "url", -1, SDS_ERROR_ID_NOT_FOUND, nullptr, nullptr},
+      {"id 0", 0, "url", -1, SDS_ERROR_INVALID_PARAMETER, nullptr, "check id:0"},
+      {"bad column", 1, "nothing", -1, SDS_ERROR_INVALID_PARAMETER, nullptr,
+       "Before finalize, sqlite response code 1"},
+  };
+  for (const TextRead& c : cases) {
+    SCOPED_TRACE(c.name);
+    LogCapture log;
+    char* value = kUntouched;
+    int code = -5;
+    EXPECT_EQ(sds_db_get_property_string(sds_db_handle, c.id, "site_deck", c.column, &value, &code),
+              c.result);
+    EXPECT_EQ(code, c.code);
+    if (c.value != nullptr) {
+      ASSERT_NE(value, kUntouched);
+      EXPECT_STREQ(value, c.value);
+      std::free(value);
+    } else {
+      EXPECT_EQ(value, kUntouched);
+    }
+    if (c.message != nullptr) {
+      EXPECT_TRUE(log.contains(c.message));
+    } else {
+      EXPECT_TRUE(log.lines().empty());
+    }
+  }
+  LogCapture log;
+  int code = 0;
+  EXPECT_EQ(sds_db_get_property_string(sds_db_handle, 1, "site_deck", "url", nullptr, &code), -1);
+  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+  EXPECT_TRUE(log.contains("check materials for query id:1"));
+  EXPECT_EQ(sds_db_get_property_string(nullptr, 1, "site_deck", "url", nullptr, &code), -1);
+  EXPECT_TRUE(log.contains("check connection handle"));
+}
+
+TEST_F(DbRows, IntegerReads) {
+  ASSERT_TRUE(db_.exec("INSERT INTO site_deck(id, url) VALUES (2, 'b')"));
+  sds_db_value value{};
+  int code = -5;
+  EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 1, "site_deck", "favicon_exists", &value, &code),
+            0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(value.i32, 1);
+
+  value = {};
+  EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 1, "site_deck", "order_index", &value, &code),
+            0);
+  EXPECT_EQ(value.i64, 2);  // a REAL arrives converted over all eight bytes
+
+  LogCapture log;
+  value = {};
+  value.i32 = 77;
+  EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 99, "site_deck", "is_dirty", &value, &code), 0);
+  EXPECT_EQ(code, SDS_ERROR_NO_DATA);
+  EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 2, "site_deck", "title", &value, &code), 0);
+  EXPECT_EQ(code, SDS_ERROR_NO_DATA);
+  EXPECT_TRUE(log.contains("check column type:5"));
+  EXPECT_EQ(value.i32, 77);
+}
+
+TEST_F(DbRows, BlobReads) {
+  ASSERT_TRUE(db_.exec("INSERT INTO site_deck(id, url) VALUES (2, 'b')"));
+  unsigned char* bytes = nullptr;
+  int size = 99;
+  int code = -5;
+  EXPECT_EQ(
+      sds_db_get_property_blob(sds_db_handle, 1, "site_deck", "icon_data", &bytes, &size, &code),
+      0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  ASSERT_EQ(size, 2);
+  EXPECT_EQ(bytes[0], 1);
+  EXPECT_EQ(bytes[1], 2);
+  std::free(bytes);
+
+  bytes = nullptr;
+  size = 99;
+  EXPECT_EQ(
+      sds_db_get_property_blob(sds_db_handle, 2, "site_deck", "icon_data", &bytes, &size, &code),
+      0);
+  EXPECT_EQ(code, SDS_ERROR_NO_DATA);
+  EXPECT_EQ(size, 0);
+  EXPECT_EQ(bytes, nullptr);
+
+  size = 99;
+  EXPECT_EQ(
+      sds_db_get_property_blob(sds_db_handle, 9, "site_deck", "icon_data", &bytes, &size, &code),
+      -1);
+  EXPECT_EQ(code, SDS_ERROR_ID_NOT_FOUND);
+  EXPECT_EQ(size, 0);
+}
+
+TEST_F(DbRows, TextReadByUrl) {
+  char* value = nullptr;
+  int code = -5;
+  EXPECT_EQ(sds_db_get_property_string_for_url(sds_db_handle, "https://a.example/", "site_deck",
+                                               "icon_size", &value, &code),
+            0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_STREQ(value, "96x64");
+  std::free(value);
+  value = kUntouched;
+  EXPECT_EQ(sds_db_get_property_string_for_url(sds_db_handle, "https://other/", "site_deck",
+                                               "icon_size", &value, &code),
+            -1);
+  EXPECT_EQ(code, SDS_ERROR_ID_NOT_FOUND);
+  LogCapture log;
+  EXPECT_EQ(
+      sds_db_get_property_string_for_url(sds_db_handle, "", "site_deck", "url", &value, &code), -1);
+  EXPECT_TRUE(log.contains("Url is null or empty"));
+  EXPECT_EQ(
+      sds_db_get_property_string_for_url(sds_db_handle, "u", "site_deck", nullptr, &value, &code),
+      -1);
+  EXPECT_TRUE(log.contains("check materials for query for url = u"));
+  EXPECT_EQ(value, kUntouched);
+}
+
+std::string ids_of(const char* cond_column, const void* cond_value, int cond_type, int* result,
+                   int* code) {
+  int* ids = nullptr;
+  int count = -1;
+  *result = sds_db_get_all_dirty_ids(sds_db_handle, &ids, &count, cond_column, cond_value,
+                                     cond_type, code);
+  if (ids == nullptr) return count == -1 ? "<untouched>" : "<count only>";
+  std::string out;
+  for (int i = 0; i < count; ++i) out += (i ? "," : "") + std::to_string(ids[i]);
+  std::free(ids);
+  return out;
+}
+
+TEST_F(DbRows, IdListsComeInOrderIndexOrder) {
+  ASSERT_TRUE(db_.exec(
+      "INSERT INTO site_deck(id, url, order_index, is_dirty) VALUES (2, 'b', 3, 1), (3, 'c', 1, "
+      "1), (4, 'd', 0, -1), (5, 'e', 4, 1)"));
+  int result = 0;
+  int code = 0;
+  EXPECT_EQ(ids_of(nullptr, nullptr, 0, &result, &code), "3,1,2,5");
+  EXPECT_EQ(result, 0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  int removed = -1;
+  EXPECT_EQ(ids_of("is_dirty", &removed, SDS_DB_COND_TYPE_INT, &result, &code), "4");
+  EXPECT_EQ(ids_of("url", "c", SDS_DB_COND_TYPE_TEXT, &result, &code), "3");
+  // A column without a value is compared with 1.
+  EXPECT_EQ(ids_of("favicon_exists", nullptr, 7, &result, &code), "1");
+
+  LogCapture log;
+  EXPECT_EQ(ids_of("url", "c", 7, &result, &code), "<untouched>");
+  EXPECT_EQ(result, -1);
+  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+  EXPECT_TRUE(log.contains("invalid type:7"));
+}
+
+TEST_F(DbRows, IdListOfNoMatchingRowIsNoDataWithOutputsUntouched) {
+  ASSERT_TRUE(db_.exec("UPDATE site_deck SET is_dirty = -1"));
+  int result = -5;
+  int code = 0;
+  EXPECT_EQ(ids_of(nullptr, nullptr, 0, &result, &code), "<untouched>");
+  EXPECT_EQ(result, 0);
+  EXPECT_EQ(code, SDS_ERROR_NO_DATA);
+}
+
+TEST_F(DbRows, ColumnReplaceByType) {
+  int code = -5;
+  int small = -1;
+  int64_t big = 5000000000;
+  const unsigned char blob[3] = {9, 0, 9};
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "is_dirty", &small, 0,
+                                  SDS_DB_COLUMN_TYPE_INT, &code),
+            0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "sync1", &big, 0,
+                                  SDS_DB_COLUMN_TYPE_INT64, &code),
+            0);
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "title", "T", 99,
+                                  SDS_DB_COLUMN_TYPE_TEXT, &code),
+            0);
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "icon_data", blob, 3,
+                                  SDS_DB_COLUMN_TYPE_BLOB, &code),
+            0);
+  EXPECT_EQ(db_.rows("SELECT is_dirty, sync1, title, hex(icon_data) FROM site_deck"),
+            "-1|5000000000|T|090009");
+}
+
+TEST_F(DbRows, ColumnReplaceRefusals) {
+  std::string before = db_.rows("SELECT * FROM site_deck");
+  int value = 5;
+  int code = -5;
+  LogCapture log;
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 0, "site_deck", "is_dirty", &value, 0, 0, &code),
+            -1);
+  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+  EXPECT_TRUE(log.contains("check id:0"));
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "is_dirty", nullptr, 0, 0, &code),
+            -1);
+  EXPECT_TRUE(log.contains("check materials for query id:1"));
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "is_dirty", &value, 4, 4, &code),
+            -1);
+  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+  EXPECT_TRUE(log.contains("invalid type:4"));
+  EXPECT_EQ(db_.rows("SELECT * FROM site_deck"), before);
+
+  // An id without a row is a successful update of nothing.
+  log.clear();
+  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 42, "site_deck", "is_dirty", &value, 0, 0, &code),
+            0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_TRUE(log.contains("Before write finalize, sqlite response code 101"));
+  EXPECT_EQ(db_.rows("SELECT * FROM site_deck"), before);
+}
+
+TEST_F(DbRows, DeleteOfUrlWithQuoteDeletesExactlyThatRow) {
+  ASSERT_TRUE(db_.exec(
+      "INSERT INTO site_deck(url) VALUES ('https://q.example/a''b'), ('https://q.example/a'), "
+      "('x'' OR ''1''=''1'), ('https://q.example/a''b')"));
+  int code = -5;
+  EXPECT_EQ(sds_db_delete_url(sds_db_handle, "https://q.example/a'b", "site_deck", &code), 0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(db_.rows("SELECT url FROM site_deck ORDER BY id"),
+            "https://a.example/\nhttps://q.example/a\nx' OR '1'='1");
+  EXPECT_EQ(sds_db_delete_url(sds_db_handle, "x' OR '1'='1", "site_deck", &code), 0);
+  EXPECT_EQ(sds_db_delete_url(sds_db_handle, "not stored", "site_deck", &code), 0);
+  EXPECT_EQ(db_.rows("SELECT url FROM site_deck ORDER BY id"),
+            "https://a.example/\nhttps://q.example/a");
+  LogCapture log;
+  EXPECT_EQ(sds_db_delete_url(sds_db_handle, "u", nullptr, &code), -1);
+  EXPECT_TRUE(log.contains("check materials for delete"));
+}
+
+TEST_F(DbRows, DuplicateChecks) {
+  int code = -5;
+  EXPECT_EQ(sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", "https://a.example/",
+                                           &code),
+            1);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", "unknown", &code),
+            -1);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(sds_db_check_duplicated_int(sds_db_handle, "site_deck", "favicon_exists", 1, &code), 1);
+  EXPECT_EQ(sds_db_check_duplicated_int(sds_db_handle, "site_deck", "favicon_exists", 0, &code), 0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(sds_db_check_duplicated_string(sds_db_handle, "site_deck", "nothing", "u", &code), -1);
+  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+}
+
+TEST_F(DbRows, InsertOfItems) {
+  ItemListGuard guard;
+  sds_item* bare = add_item("https://b.example/", nullptr, nullptr);
+  bare->fav_icon_exists = 1;
+  sds_item* full = add_item("https://c.example/", "C", "#112233");
+  add_icon(full, "https://c.example/i.png", "192x192", "2024-01-01");
+  add_icon(full, "https://c.example/j.png", "64", "other");
+  sds_item* pathless = add_item(nullptr, "no url");
+  add_icon(pathless, nullptr, "1x1", "t");
+
+  int code = -5;
+  EXPECT_EQ(sds_db_create_site_deck_item(sds_db_handle, bare, &code), 2);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(sds_db_create_site_deck_item(sds_db_handle, full, &code), 3);
+  EXPECT_EQ(sds_db_create_site_deck_item(sds_db_handle, pathless, &code), 4);
+  EXPECT_EQ(db_.rows("SELECT id, url, title, favicon_exists, dominant_color, touch_icon_exists, "
+                     "icon_size, image_last_updated, icon_path, is_dirty, order_index, icon_data "
+                     "FROM site_deck WHERE id > 1"),
+            "2|https://b.example/|NULL|1||0||||1|0|NULL\n"
+            "3|https://c.example/|C|0|#112233|1|192x192|2024-01-01|https://c.example/i.png|1|0|"
+            "NULL\n"
+            "4|NULL|no url|0||1|1x1|t|NULL|1|0|NULL");
+
+  int id = 0;
+  EXPECT_EQ(sds_db_create_site_deck_id(sds_db_handle, &id, &code), 0);
+  EXPECT_EQ(id, 5);
+  EXPECT_EQ(db_.rows("SELECT quote(url), is_dirty FROM site_deck WHERE id = 5"), "''|1");
+
+  EXPECT_EQ(sds_db_create_site_deck_item(nullptr, full, &code), -1);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+}
+
+}  // namespace

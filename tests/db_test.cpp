@@ -1,0 +1,158 @@
+// The database file and connection: creation, rebuild, error mapping.
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <filesystem>
+#include <string>
+
+#include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db.h"
+#include "sitedeck-service-paths.h"
+#include "support/db_session.h"
+#include "support/log_capture.h"
+
+namespace {
+
+constexpr const char* kTableSql =
+    "CREATE TABLE site_deck(id INTEGER UNIQUE PRIMARY KEY,url TEXT DEFAULT NULL,title TEXT "
+    "DEFAULT NULL,favicon_exists  INTEGER DEFAULT 0,dominant_color TEXT DEFAULT "
+    "NULL,touch_icon_exists INTEGER DEFAULT 0,touchicon TEXT,is_dirty INTEGER DEFAULT "
+    "1,image_last_updated TEXT,icon_size TEXT,icon_path TEXT,icon_data BLOB,order_index INTEGER "
+    "DEFAULT 0,sync1 TEXT DEFAULT NULL,sync2 TEXT DEFAULT NULL,sync3 TEXT DEFAULT NULL,sync4 TEXT "
+    "DEFAULT NULL)";
+
+TEST(DbOpen, FirstStartCreatesTheTableWithAllColumnsAndDefaults) {
+  LogCapture log;
+  DbSession db;
+  ASSERT_NE(sds_db_handle, nullptr);
+  EXPECT_TRUE(file_exists(db.db_path()));
+  EXPECT_EQ(db.rows("SELECT sql FROM sqlite_master WHERE name='site_deck'"), kTableSql);
+  EXPECT_EQ(db.rows("SELECT name, type, dflt_value FROM pragma_table_info('site_deck')"),
+            "id|INTEGER|NULL\n"
+            "url|TEXT|NULL\n"
+            "title|TEXT|NULL\n"
+            "favicon_exists|INTEGER|0\n"
+            "dominant_color|TEXT|NULL\n"
+            "touch_icon_exists|INTEGER|0\n"
+            "touchicon|TEXT|NULL\n"
+            "is_dirty|INTEGER|1\n"
+            "image_last_updated|TEXT|NULL\n"
+            "icon_size|TEXT|NULL\n"
+            "icon_path|TEXT|NULL\n"
+            "icon_data|BLOB|NULL\n"
+            "order_index|INTEGER|0\n"
+            "sync1|TEXT|NULL\n"
+            "sync2|TEXT|NULL\n"
+            "sync3|TEXT|NULL\n"
+            "sync4|TEXT|NULL");
+  ASSERT_TRUE(db.exec("INSERT INTO site_deck(url) VALUES ('https://a.example/')"));
+  EXPECT_EQ(db.rows("SELECT * FROM site_deck"),
+            "1|https://a.example/|NULL|0|NULL|0|NULL|1|NULL|NULL|NULL|NULL|0|NULL|NULL|NULL|NULL");
+  // A missing file is opened with a plain CANTOPEN first.
+  EXPECT_TRUE(log.contains("database open error(14):unable to open database file"));
+  EXPECT_FALSE(log.contains("errorcode : 0"));
+}
+
+TEST(DbOpen, FileThatIsNoDatabaseIsReplacedByAnEmptyTable) {
+  DbSession db(false);
+  ASSERT_TRUE(write_file(db.db_path(), std::string(4096, 'g') + "garbage, not a database"));
+  ASSERT_TRUE(write_file(db.db_path() + "-journal", "stale journal"));
+  LogCapture log;
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  ASSERT_NE(sds_db_handle, nullptr);
+  EXPECT_EQ(db.rows("SELECT count(*) FROM site_deck"), "0");
+  EXPECT_TRUE(log.contains("database open error(26):file is not a database"));
+  EXPECT_FALSE(file_exists(db.db_path() + "-journal"));
+}
+
+TEST(DbOpen, ExistingFileWithTheTableKeepsItsRows) {
+  DbSession db;
+  ASSERT_TRUE(db.exec("INSERT INTO site_deck(url, title) VALUES ('u', 't')"));
+  DbSession::close_handle();
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_EQ(db.rows("SELECT url, title FROM site_deck"), "u|t");
+}
+
+TEST(DbOpen, ExistingFileWithoutTheTableIsLeftAsItIs) {
+  DbSession db(false);
+  sqlite3* other = nullptr;
+  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &other), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(other, "CREATE TABLE other(x); INSERT INTO other VALUES (7)", nullptr,
+                         nullptr, nullptr),
+            SQLITE_OK);
+  sqlite3_close(other);
+
+  LogCapture log;
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_EQ(__check_table(sds_db_handle, "site_deck"), -1);
+  EXPECT_EQ(db.rows("SELECT name FROM sqlite_master"), "other");
+  EXPECT_EQ(db.rows("SELECT x FROM other"), "7");
+  EXPECT_TRUE(log.lines().empty());
+}
+
+TEST(DbOpen, MissingDatabaseDirectoryFailsWithNoSpace) {
+  DbSession db(false);
+  std::filesystem::remove_all(db.root().path(SDS_DATABASE_DIR));
+  LogCapture log;
+  sqlite3* handle = reinterpret_cast<sqlite3*>(0x1);
+  EXPECT_EQ(sds_db_open(&handle), -1);
+  EXPECT_EQ(handle, nullptr);
+  EXPECT_TRUE(log.contains("database new error(14):unable to open database file"));
+  EXPECT_TRUE(log.contains("errorcode : 14"));
+  EXPECT_FALSE(file_exists(db.db_path()));
+
+  // The worker tries again at its next call and succeeds once the directory is back.
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_DB_OPEN_FAILED);
+  EXPECT_EQ(sds_db_handle, nullptr);
+  std::filesystem::create_directories(db.root().path(SDS_DATABASE_DIR));
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_NE(sds_db_handle, nullptr);
+}
+
+TEST(DbOpen, CheckTableNeedsHandleAndName) {
+  DbSession db;
+  LogCapture log;
+  EXPECT_EQ(__check_table(nullptr, "site_deck"), -1);
+  EXPECT_EQ(__check_table(sds_db_handle, nullptr), -1);
+  EXPECT_EQ(log.count("check handle or table name"), 2);
+  EXPECT_EQ(__check_table(sds_db_handle, "site_deck"), 0);
+  EXPECT_EQ(__check_table(sds_db_handle, "nothing"), -1);
+}
+
+TEST(DbClose, VacuumsAndClosesAndAcceptsNull) {
+  DbSession db;
+  sds_db_close(nullptr);
+  __db_finalize(nullptr);
+  LogCapture log;
+  sds_db_close(sds_db_handle);
+  sds_db_handle = nullptr;
+  EXPECT_TRUE(log.lines().empty());
+}
+
+TEST(DbErrorCode, MapsTheConnectionsLastResult) {
+  DbSession db;
+  LogCapture log;
+  EXPECT_EQ(sds_db_get_errorcode(nullptr), SDS_ERROR_DISK_BUSY);
+  EXPECT_TRUE(log.contains("check connection handle"));
+
+  // A second connection without a busy timeout meets the lock at once.
+  sqlite3* locker = nullptr;
+  sqlite3* blocked = nullptr;
+  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &locker), SQLITE_OK);
+  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &blocked), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(locker, "BEGIN EXCLUSIVE", nullptr, nullptr, nullptr), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(blocked, "SELECT * FROM site_deck", nullptr, nullptr, nullptr),
+            SQLITE_BUSY);
+  EXPECT_EQ(sds_db_get_errorcode(blocked), SDS_ERROR_DISK_BUSY);
+  EXPECT_TRUE(log.contains("DISK_BUSY database is locked"));
+  sqlite3_exec(locker, "ROLLBACK", nullptr, nullptr, nullptr);
+
+  // Errors without a specific reason map to none.
+  ASSERT_EQ(sqlite3_exec(blocked, "SELECT nothing FROM site_deck", nullptr, nullptr, nullptr),
+            SQLITE_ERROR);
+  EXPECT_EQ(sds_db_get_errorcode(blocked), SDS_ERROR_NONE);
+  sqlite3_close(locker);
+  sqlite3_close(blocked);
+}
+
+}  // namespace
