@@ -1,0 +1,260 @@
+// The merge of a downloaded item list into a real database file.
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <signal.h>
+#include <sqlite3.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <string>
+
+#include "database/sitedeck-service-db-interface.h"
+#include "sitedeck-service-request-server.h"
+#include "sitedeck-service-utils.h"
+#include "support/db_session.h"
+#include "support/items.h"
+#include "support/log_capture.h"
+#include "support/png_maker.h"
+
+namespace {
+
+constexpr const char* kA = "https://a.example/";
+constexpr const char* kB = "https://b.example/";
+constexpr const char* kC = "https://c.example/";
+constexpr const char* kD = "https://d.example/";
+
+class Merge : public ::testing::Test {
+ protected:
+  void SetUp() override { ASSERT_NE(sds_db_handle, nullptr); }
+
+  // Merges the global list built so far, then releases it for the next list.
+  static int merge() {
+    int result = insert_sitedeck_items_in_db(sds_item_list_head);
+    sds_free_item_list();
+    return result;
+  }
+  // url|title|colour|is_dirty|order_index of every row, by URL.
+  static std::string table() {
+    return DbSession::rows(
+        "SELECT url, title, dominant_color, is_dirty, order_index FROM site_deck ORDER BY url");
+  }
+
+  DbSession db_;
+  ItemListGuard guard_;
+};
+
+TEST_F(Merge, FirstMergeNumbersSitesInListOrder) {
+  add_item(kC, "C", "#333333");
+  add_item(kA, nullptr, nullptr);
+  add_item(kB, "", "#222222");
+  LogCapture log;
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(table(),
+            "https://a.example/|https://a.example/||1|2\n"
+            "https://b.example/|https://b.example/|#222222|1|3\n"
+            "https://c.example/|C|#333333|1|1");
+  EXPECT_FALSE(log.contains("Not able to delete one URL"));
+}
+
+TEST_F(Merge, RefreshReordersAndDeletesVanishedLiveSites) {
+  add_item(kA, "A", "#111111")->fav_icon_exists = 1;
+  add_item(kB, "B", "#222222");
+  add_item(kC, "C", "#333333");
+  ASSERT_EQ(merge(), 0);
+
+  add_item(kC, "C2", nullptr);  // a null colour keeps the stored one
+  sds_item* a = add_item(kA, "A2", "#999999");
+  a->fav_icon_exists = 0;
+  a->touch_icons_exists = 1;
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(table(),
+            "https://a.example/|A2|#999999|1|2\n"
+            "https://c.example/|C2|#333333|1|1");
+  // The flags of a stored row keep the values of its first insert.
+  EXPECT_EQ(db_.rows("SELECT favicon_exists, touch_icon_exists FROM site_deck WHERE url = '" +
+                     std::string(kA) + "'"),
+            "1|0");
+}
+
+TEST_F(Merge, SpeciallyRemovedSiteIsKeptAndComesBack) {
+  add_item(kA, "A");
+  add_item(kB, "B");
+  ASSERT_EQ(merge(), 0);
+
+  add_item(kA, "A");
+  add_item(kB, "B", nullptr, 1);
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(table(),
+            "https://a.example/|A||1|1\n"
+            "https://b.example/|B||-1|2");
+
+  // Gone from the list, but not live: the clean-up leaves it.
+  add_item(kA, "A");
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(table(),
+            "https://a.example/|A||1|1\n"
+            "https://b.example/|B||-1|2");
+
+  add_item(kB, "B");
+  add_item(kA, "A");
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(table(),
+            "https://a.example/|A||1|2\n"
+            "https://b.example/|B||1|1");
+}
+
+TEST_F(Merge, ItemsWithoutUrlTakeNoNumber) {
+  add_item(nullptr, "no url");
+  add_item(kA, "A");
+  add_item("", "empty url");
+  add_item(kB, "B");
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(table(),
+            "https://a.example/|A||1|1\n"
+            "https://b.example/|B||1|2");
+}
+
+TEST_F(Merge, DuplicateUrlLeavesOneRowWithTheSecondOccurrence) {
+  add_item(kA, "A1", "#111111");
+  add_item(kB, "B");
+  add_item(kA, "A2", "#999999");
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(table(),
+            "https://a.example/|A2|#999999|1|3\n"
+            "https://b.example/|B||1|2");
+}
+
+TEST_F(Merge, AllSpeciallyRemovedEndsWithMinusOneAfterStoringTheFlags) {
+  add_item(kA, "A", nullptr, 1);
+  add_item(kB, "B", nullptr, 1);
+  LogCapture log;
+  EXPECT_EQ(merge(), -1);
+  EXPECT_TRUE(log.contains("Error : 6"));
+  // Stored for good: another connection sees the rows.
+  EXPECT_EQ(rows_of_file(db_.db_path(), "SELECT url, is_dirty, order_index FROM site_deck"),
+            "https://a.example/|-1|1\nhttps://b.example/|-1|2");
+}
+
+TEST_F(Merge, StoresDownloadedIconsAndKeepsStoredOnes) {
+  sds_item* a = add_item(kA, "A");
+  add_icon(a, "https://a.example/i.png", "2x2", "t1");
+  char* path = get_icon_path("https://a.example/i.png");
+  ASSERT_TRUE(png_write_file(path, png_pattern(2, 2, 6, 8)));
+  ASSERT_EQ(merge(), 0);
+  EXPECT_FALSE(file_exists(path));
+  std::free(path);
+
+  add_item(kA, "A");  // icon unchanged: no icons left on the item
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(db_.rows("SELECT icon_size, icon_path, image_last_updated, length(icon_data) FROM "
+                     "site_deck"),
+            "2x2|https://a.example/i.png|t1|16");
+}
+
+TEST_F(Merge, EmptyListIsRefusedInsteadOfDeletingEverySite) {
+  add_item(kA, "A");
+  ASSERT_EQ(merge(), 0);
+  EXPECT_EQ(insert_sitedeck_items_in_db(nullptr), -1);
+  EXPECT_EQ(db_.rows("SELECT count(*) FROM site_deck"), "1");
+}
+
+TEST_F(Merge, LongListIsMergedAndCleanedUp) {
+  for (int i = 0; i < 2000; ++i) add_item(("https://s" + std::to_string(i) + ".example/").c_str());
+  ASSERT_EQ(merge(), 0);
+  for (int i = 1999; i >= 0; i -= 2)
+    add_item(("https://s" + std::to_string(i) + ".example/").c_str());
+  EXPECT_EQ(merge(), 0);
+  EXPECT_EQ(db_.rows("SELECT count(*), min(order_index), max(order_index) FROM site_deck"),
+            "1000|1|1000");
+  EXPECT_EQ(db_.rows("SELECT url FROM site_deck WHERE order_index = 1"), "https://s1999.example/");
+  EXPECT_EQ(db_.rows("SELECT count(*) FROM site_deck WHERE url LIKE '%0.example/'"), "0");
+}
+
+// Denies reads of order_index, which only the clean-up's id list does.
+int deny_order_index(void*, int action, const char*, const char* column, const char*, const char*) {
+  if (action == SQLITE_READ && column != nullptr && std::strcmp(column, "order_index") == 0) {
+    return SQLITE_DENY;
+  }
+  return SQLITE_OK;
+}
+
+TEST_F(Merge, MergeWhoseCleanupFailsLeavesThePreviousTableWhole) {
+  add_item(kA, "A");
+  add_item(kB, "B");
+  ASSERT_EQ(merge(), 0);
+  std::string before = db_.rows("SELECT * FROM site_deck ORDER BY id");
+
+  add_item(kC, "C");
+  add_item(kB, "B2");
+  add_item(kD, "D", nullptr, 1);
+  sqlite3_set_authorizer(sds_db_handle, deny_order_index, nullptr);
+  LogCapture log;
+  EXPECT_EQ(merge(), -1);
+  sqlite3_set_authorizer(sds_db_handle, nullptr, nullptr);
+  EXPECT_TRUE(log.contains("Error : 5"));
+  EXPECT_EQ(db_.rows("SELECT * FROM site_deck ORDER BY id"), before);
+}
+
+struct PauseState {
+  int ready_fd;
+  int changes;
+  int pause_at;
+};
+
+// Signals the parent and stops for good after `pause_at` row changes.
+void pause_after_changes(void* arg, int, const char*, const char*, sqlite3_int64) {
+  auto* state = static_cast<PauseState*>(arg);
+  if (++state->changes != state->pause_at) return;
+  char byte = 'x';
+  (void)!write(state->ready_fd, &byte, 1);
+  for (;;) pause();
+}
+
+TEST_F(Merge, MergeCutInHalfIsNeverSeenAndNeverLeftBehind) {
+  add_item(kA, "A");
+  add_item(kB, "B");
+  ASSERT_EQ(merge(), 0);
+  const std::string dump = "SELECT * FROM site_deck ORDER BY id";
+  std::string before = db_.rows(dump);
+  DbSession::close_handle();
+
+  int fds[2];
+  ASSERT_EQ(pipe(fds), 0);
+  pid_t pid = fork();
+  ASSERT_GE(pid, 0);
+  if (pid == 0) {
+    // The child merges [D, A, C] on its own connection and freezes after
+    // inserting D and renumbering A, as a process killed mid-way would.
+    close(fds[0]);
+    if (sds_ensure_db_open() != SDS_ERROR_NONE) _exit(2);
+    PauseState state{fds[1], 0, 4};
+    sqlite3_update_hook(sds_db_handle, pause_after_changes, &state);
+    add_item(kD, "D");
+    add_item(kA, "A2");
+    add_item(kC, "C");
+    (void)insert_sitedeck_items_in_db(sds_item_list_head);
+    _exit(3);
+  }
+  close(fds[1]);
+  pollfd ready{fds[0], POLLIN, 0};
+  ASSERT_EQ(poll(&ready, 1, 60000), 1);
+  char byte = 0;
+  EXPECT_EQ(read(fds[0], &byte, 1), 1);
+  close(fds[0]);
+
+  // A reader during the merge sees the previous table.
+  EXPECT_EQ(rows_of_file(db_.db_path(), dump), before);
+
+  ASSERT_EQ(kill(pid, SIGKILL), 0);
+  int status = 0;
+  ASSERT_EQ(waitpid(pid, &status, 0), pid);
+  EXPECT_TRUE(WIFSIGNALED(status));
+
+  // The next opening rolls the cut merge back.
+  ASSERT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_EQ(db_.rows(dump), before);
+}
+
+}  // namespace
