@@ -156,7 +156,7 @@ TEST_F(Merge, StoresDownloadedIconsAndKeepsStoredOnes) {
 TEST_F(Merge, EmptyListIsRefusedInsteadOfDeletingEverySite) {
   add_item(kA, "A");
   ASSERT_EQ(merge(), 0);
-  EXPECT_EQ(insert_sitedeck_items_in_db(nullptr), -1);
+  EXPECT_EQ(insert_sitedeck_items_in_db(nullptr), SDS_MERGE_NOT_COMMITTED);
   EXPECT_EQ(db_.rows("SELECT count(*) FROM site_deck"), "1");
 }
 
@@ -191,7 +191,7 @@ TEST_F(Merge, MergeWhoseCleanupFailsLeavesThePreviousTableWhole) {
   add_item(kD, "D", nullptr, 1);
   sqlite3_set_authorizer(sds_db_handle, deny_order_index, nullptr);
   LogCapture log;
-  EXPECT_EQ(merge(), -1);
+  EXPECT_EQ(merge(), SDS_MERGE_NOT_COMMITTED);
   sqlite3_set_authorizer(sds_db_handle, nullptr, nullptr);
   EXPECT_TRUE(log.contains("Error : 5"));
   EXPECT_EQ(db_.rows("SELECT * FROM site_deck ORDER BY id"), before);

@@ -36,5 +36,11 @@ int get_sitedeck_icon_dominant_color(int id, char** color);
 int get_sitedeck_icon_time_stamp(int id, char** time_stamp);
 int get_sitedeck_item_from_db(int id, sds_item* item);
 
-// Merges a parsed item list into the table, in one transaction.
+// Merges a parsed item list into the table, in one transaction. Returns 0; -1
+// when the merge committed but found no live row to clean up;
+// SDS_MERGE_NOT_COMMITTED when it was rolled back and the table is unchanged.
 int insert_sitedeck_items_in_db(sds_item* head);
+
+// Result of insert_sitedeck_items_in_db when its transaction was rolled back
+// and the table still holds the previous list.
+constexpr int SDS_MERGE_NOT_COMMITTED = -2;

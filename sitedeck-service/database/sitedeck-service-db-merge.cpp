@@ -103,9 +103,9 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   // An empty list would make pass 2 delete every live site.
   if (head == nullptr) {
     SDS_LOGE("NULL check::item");
-    return -1;
+    return SDS_MERGE_NOT_COMMITTED;
   }
-  if (!run("BEGIN IMMEDIATE")) return -1;
+  if (!run("BEGIN IMMEDIATE")) return SDS_MERGE_NOT_COMMITTED;
 
   int order = 1;
   for (sds_item* item = head; item != nullptr; item = item->next) {
@@ -119,7 +119,7 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   // an I/O error); then there is nothing left to commit.
   if (sqlite3_get_autocommit(sds_db_handle) != 0) {
     SDS_LOGE("merge transaction was rolled back");
-    return -1;
+    return SDS_MERGE_NOT_COMMITTED;
   }
   // With no live row there is nothing to clean up and the merge is whole,
   // though it answers -1. Any other failed clean-up would leave vanished
@@ -127,5 +127,5 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   bool keep = code == SDS_ERROR_NONE || code == SDS_ERROR_NO_DATA;
   if (keep && run("COMMIT")) return code == SDS_ERROR_NONE ? 0 : -1;
   (void)run("ROLLBACK");
-  return -1;
+  return SDS_MERGE_NOT_COMMITTED;
 }
