@@ -15,6 +15,13 @@
 
 namespace {
 
+int __sds_client_set_timeout(int fd, int milliseconds) {
+  struct timeval timeout {};
+  timeout.tv_sec = milliseconds / 1000;
+  timeout.tv_usec = (milliseconds % 1000) * 1000;
+  return setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
+}
+
 int __sds_client_connect_socket(int fd, const struct sockaddr_un& address) {
   int result = 0;
   do {
@@ -25,8 +32,8 @@ int __sds_client_connect_socket(int fd, const struct sockaddr_un& address) {
 
 }  // namespace
 
-int sds_client_connect(const std::string& socket_path, SdsConnection* out) {
-  if (out == nullptr) return SDS_ERROR_INVALID_PARAMETER;
+int sds_client_connect(const std::string& socket_path, SdsConnection* out, int read_timeout_ms) {
+  if (out == nullptr || read_timeout_ms < 0) return SDS_ERROR_INVALID_PARAMETER;
   struct sockaddr_un address {};
   address.sun_family = AF_UNIX;
   if (socket_path.empty() || socket_path.size() >= sizeof address.sun_path) {
@@ -44,6 +51,9 @@ int sds_client_connect(const std::string& socket_path, SdsConnection* out) {
     SDS_LOGE("[ERROR] connect %s [%s]", socket_path.c_str(), strerror(errno));
     return SDS_ERROR_IO_ERROR;
   }
+  if (read_timeout_ms > 0 && __sds_client_set_timeout(fd.get(), read_timeout_ms) != 0) {
+    return SDS_ERROR_IO_ERROR;
+  }
   // The service answers the connection with a status, and with the client id
   // only when that status is 0.
   int status = sds_ipc_read_errorcode(fd.get());
@@ -57,13 +67,8 @@ int sds_client_connect(const std::string& socket_path, SdsConnection* out) {
 
 int sds_client_set_timeout(const SdsConnection& connection, int milliseconds) {
   if (milliseconds < 0) return SDS_ERROR_INVALID_PARAMETER;
-  struct timeval timeout {};
-  timeout.tv_sec = milliseconds / 1000;
-  timeout.tv_usec = (milliseconds % 1000) * 1000;
-  if (setsockopt(connection.fd(), SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout) != 0) {
-    return SDS_ERROR_IO_ERROR;
-  }
-  return SDS_ERROR_NONE;
+  return __sds_client_set_timeout(connection.fd(), milliseconds) == 0 ? SDS_ERROR_NONE
+                                                                      : SDS_ERROR_IO_ERROR;
 }
 
 sds_command sds_client_header(const SdsConnection& connection, int32_t cmd, int32_t item_id) {

@@ -26,7 +26,8 @@ class SdsConnection {
   }
 
  private:
-  friend int sds_client_connect(const std::string& socket_path, SdsConnection* out);
+  friend int sds_client_connect(const std::string& socket_path, SdsConnection* out,
+                                int read_timeout_ms);
   UniqueFd fd_;
   int32_t cid_ = 0;
 };
@@ -36,8 +37,10 @@ class SdsConnection {
 // instead (SDS_ERROR_SHM_FAILED, SDS_ERROR_OUT_OF_MEMORY); SDS_ERROR_IO_ERROR
 // when the socket can't be reached or the handshake is cut short; or
 // SDS_ERROR_INVALID_PARAMETER for a path too long for a socket address.
-// `out` is left as it was on failure.
-int sds_client_connect(const std::string& socket_path, SdsConnection* out);
+// A `read_timeout_ms` above 0 bounds every read, the handshake's included (see
+// sds_client_set_timeout). `out` is left as it was on failure.
+int sds_client_connect(const std::string& socket_path, SdsConnection* out,
+                       int read_timeout_ms = 0);
 
 // Makes a read that waits longer than `milliseconds` fail (0: wait forever).
 // The primitives try a read three times, so a silent service is given up on
