@@ -39,8 +39,7 @@ class SdsConnection {
 // SDS_ERROR_INVALID_PARAMETER for a path too long for a socket address.
 // A `read_timeout_ms` above 0 bounds every read, the handshake's included (see
 // sds_client_set_timeout). `out` is left as it was on failure.
-int sds_client_connect(const std::string& socket_path, SdsConnection* out,
-                       int read_timeout_ms = 0);
+int sds_client_connect(const std::string& socket_path, SdsConnection* out, int read_timeout_ms = 0);
 
 // Makes a read that waits longer than `milliseconds` fail (0: wait forever).
 // The primitives try a read three times, so a silent service is given up on

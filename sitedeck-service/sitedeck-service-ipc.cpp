@@ -184,8 +184,8 @@ char* sds_ipc_read_string(int sock) {
     SDS_LOGE("[ERROR] calloc length:%d sock:%d [%s]", length, sock, strerror(errno));
     return nullptr;
   }
-  result = __sds_ipc_read_chunks(sock, text.get(), static_cast<size_t>(length),
-                                 "sds_ipc_read_string");
+  result =
+      __sds_ipc_read_chunks(sock, text.get(), static_cast<size_t>(length), "sds_ipc_read_string");
   if (result == 0) {
     SDS_LOGE("[ERROR] closed peer sock:%d", sock);
     return nullptr;

@@ -154,8 +154,8 @@ TEST(Activation, SitedeckHelloPrintsTheClientId) {
   TempRoot root;
   ServiceHarness service;
   ASSERT_TRUE(service.start_activated());
-  std::string command = std::string(SITEDECK_BIN_DIR) + "/sitedeck --socket '" +
-                        service.socket_path() + "' hello";
+  std::string command =
+      std::string(SITEDECK_BIN_DIR) + "/sitedeck --socket '" + service.socket_path() + "' hello";
   FILE* tool = popen(command.c_str(), "r");
   ASSERT_NE(tool, nullptr);
   char line[128] = {};

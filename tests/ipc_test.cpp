@@ -152,7 +152,8 @@ TEST_F(IpcTest, CheckStderrMapsErrnoToCodes) {
 TEST_F(IpcTest, WriteToVanishedPeerFailsWithoutKillingTheProcess) {
   close_peer();
   EXPECT_EQ(sds_ipc_send_errorcode(service(), 0), -1);
-  EXPECT_TRUE(log_.contains(format("[IPC.Write] exception sock:%d [%s]", service(), strerror(EPIPE))));
+  EXPECT_TRUE(
+      log_.contains(format("[IPC.Write] exception sock:%d [%s]", service(), strerror(EPIPE))));
 }
 
 TEST_F(IpcTest, WritersRefuseBadSocketAndBuffer) {

@@ -110,7 +110,8 @@ TEST_F(WorkerTest, HeaderCheckEndsTheConnectionOnUnusableHeaders) {
     EXPECT_EQ(__sds_handle_client_request(&slot), c.result) << c.name;
     EXPECT_EQ(slot.client_id, c.client_id_after) << c.name;
     if (c.message != nullptr) {
-      EXPECT_TRUE(log_.contains(format("[Closed Peer] sock:%d %s", slot.sock, c.message))) << c.name;
+      EXPECT_TRUE(log_.contains(format("[Closed Peer] sock:%d %s", slot.sock, c.message)))
+          << c.name;
     }
     EXPECT_FALSE(readable_now(pair.peer.get())) << c.name;
   }
@@ -203,7 +204,8 @@ TEST_F(WorkerTest, AcceptorSendsTheHandshakeAndTheWorkerEndsTheLoopWhenTheClient
   EXPECT_EQ(handshake[1], context.client.client_id);
   EXPECT_NE(context.client.thread, pthread_t{});
   bool warned = false;
-  for (const auto& line : log_.lines()) warned |= line.message == "sds_main_thread end" && line.prio == 5;
+  for (const auto& line : log_.lines())
+    warned |= line.message == "sds_main_thread end" && line.prio == 5;
   EXPECT_TRUE(warned);
   struct stat st {};
   EXPECT_EQ(stat(SDS_SHM_FILE_PATH, &st), 0);

@@ -51,9 +51,7 @@ int remaining_ms(std::chrono::steady_clock::time_point deadline) {
 
 }  // namespace
 
-int exit_code_of(int wait_status) {
-  return WIFEXITED(wait_status) ? WEXITSTATUS(wait_status) : -1;
-}
+int exit_code_of(int wait_status) { return WIFEXITED(wait_status) ? WEXITSTATUS(wait_status) : -1; }
 
 ServiceHarness::ServiceHarness() {
   const char* root = std::getenv("SITEDECK_ROOT");
@@ -74,7 +72,8 @@ ServiceHarness::~ServiceHarness() {
 bool ServiceHarness::spawn(const std::vector<std::string>& argv, int fd3,
                            bool activation_environment) {
   if (root_.empty() || pid_ > 0) return false;
-  int out_fd = open(stderr_path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_APPEND | O_CLOEXEC, 0644);
+  int out_fd =
+      open(stderr_path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_APPEND | O_CLOEXEC, 0644);
   if (out_fd < 0) return false;
 
   // Everything the child needs is built here: after fork only
