@@ -1,2 +1,108 @@
-// Placeholder until the service spine lands.
-int main() { return 1; }
+// The process entry of the service, the only part that knows it is a daemon.
+// It takes over the listening socket that socket activation passes in (it
+// never binds one of its own), installs the signal handling, lets the
+// acceptor take exactly one connection and start its worker, and parks in an
+// empty main loop until the worker ends it. One process serves one connection.
+#include <glib.h>
+#include <pthread.h>
+#include <sys/socket.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <csignal>
+#include <cstdlib>
+#include <new>
+#include <string>
+
+#include "sitedeck-service-log.h"
+#include "sitedeck-service-main.h"
+#include "sitedeck-service-paths.h"
+
+namespace {
+
+// Read by the SIGTERM handler; null until the context exists and again once
+// it is being released.
+std::atomic<sds_server_context*> g_context{nullptr};
+
+// Returns the first passed descriptor the activation check does not reject.
+// A result of 0 (a socket, but not listening at our path) is accepted too:
+// the activation unit decides what it hands over.
+int __sds_accept_socket(void) {
+  int count = sd_listen_fds(1);
+  std::string path = sds_path(SDS_SOCKET_PATH);
+  for (int fd = SD_LISTEN_FDS_START; count > 0 && fd < SD_LISTEN_FDS_START + count; ++fd) {
+    if (sd_is_socket_unix(fd, SOCK_STREAM, 1, path.c_str(), 0) >= 0) {
+      SDS_LOGI("listen systemd socket:%d", fd);
+      return fd;
+    }
+  }
+  return -1;
+}
+
+// Closing the listening socket makes a pending accept fail; SIGUSR1 keeps its
+// default action, so signalling the worker ends the whole process at once.
+// Uses only async-signal-safe calls.
+void __sds_stop(sds_server_context* context) {
+  if (context->listen_sock >= 0) {
+    (void)close(context->listen_sock);
+    context->listen_sock = -1;
+  }
+  if (context->client.thread != 0) (void)pthread_kill(context->client.thread, SIGUSR1);
+}
+
+void sds_sigterm_handler(int /*signal_number*/) {
+  sds_server_context* context = g_context.load();
+  // Before the context exists there is no connection and nothing to stop.
+  if (context == nullptr) _exit(255);
+  __sds_stop(context);
+}
+
+}  // namespace
+
+int main() {
+  // The GLib type system initialises itself; nothing to call before the loop.
+  sds_main_loop = g_main_loop_new(nullptr, FALSE);
+  if (sds_main_loop == nullptr) {
+    SDS_LOGE("Failed to create g main loop handle");
+    return 0;
+  }
+
+  int listen_sock = __sds_accept_socket();
+  if (listen_sock < 0) {
+    SDS_LOGE("[CRITICAL]  Failed to get the socket");
+    std::exit(1);
+  }
+
+  if (std::signal(SIGTERM, sds_sigterm_handler) == SIG_ERR ||
+      std::signal(SIGPIPE, SIG_IGN) == SIG_ERR) {
+    SDS_LOGE("failed to register signal callback");
+  }
+
+  auto* context = new (std::nothrow) sds_server_context{};
+  if (context == nullptr) {
+    // Without a context no connection can be taken, and a loop without a
+    // worker would never end.
+    SDS_LOGE("[CRITICAL] Failed to allocate the service context");
+    (void)close(listen_sock);
+    g_main_loop_unref(sds_main_loop);
+    return -1;
+  }
+  context->listen_sock = listen_sock;
+  g_context.store(context);
+
+  int result = 0;
+  if (sds_main_thread(context) != 0) {
+    g_context.store(nullptr);
+    __sds_stop(context);
+    result = -1;
+  } else {
+    g_main_loop_run(sds_main_loop);
+    // From here on a SIGTERM simply ends the process: the context goes away.
+    (void)std::signal(SIGTERM, SIG_DFL);
+    g_context.store(nullptr);
+  }
+  delete context;
+  g_main_loop_unref(sds_main_loop);
+  return result;
+}

@@ -4,6 +4,8 @@
 // time until the connection ends, and quits the main loop.
 #pragma once
 
+#include <cstdint>
+
 #include "sitedeck-service-types.h"
 
 typedef struct _GMainLoop GMainLoop;
@@ -19,3 +21,6 @@ void* sds_client_thread_idle(void* slot);
 int __sds_handle_client_request(sds_client* slot);
 // Returns a new client id, always greater than 0 and never the previous one.
 int sds_generate_client_id(void);
+// The id for a time of day (seconds, microseconds), in wrapping 32-bit
+// arithmetic; results of 0 or below are folded into the positive range.
+int32_t sds_client_id_from_time(int32_t seconds, int32_t microseconds);

@@ -1,2 +1,0 @@
-// Placeholder until the client tool lands.
-int main() { return 1; }
