@@ -6,6 +6,7 @@
 #include "sitedeck-service-request-handler.h"
 #include "support/log_capture.h"
 #include "support/socket_pair.h"
+#include "support/temp_root.h"
 
 namespace {
 
@@ -15,6 +16,7 @@ class DispatcherTest : public ::testing::Test {
     slot_.client_id = 5;
     slot_.sock = pair_.service.get();
   }
+  TempRoot root_;  // the dispatcher opens the item database first
   SocketPair pair_;
   sds_client slot_;
   LogCapture log_;

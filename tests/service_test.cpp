@@ -84,6 +84,7 @@ class WorkerTest : public ::testing::Test {
     return !guard_fired;
   }
 
+  TempRoot root_;  // the worker opens the item database first
   LogCapture log_;
 };
 
