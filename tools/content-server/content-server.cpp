@@ -124,8 +124,13 @@ void handle_item_list(cs_server* s, const httplib::Request& req, httplib::Respon
     if (f.status >= 300 && f.status < 400 && !f.location.empty()) {
       res.set_header("Location", f.location);
     }
-    if (f.status == 304) set_caching_headers(res, f, std::string());
-    if (f.status != 304) res.set_content("status " + std::to_string(f.status) + "\n", "text/plain");
+    if (f.status == 304) {
+      cs_faults no_etag = f;  // a forced 304 has no list, so no ETag to send
+      no_etag.etag = "none";
+      set_caching_headers(res, no_etag, std::string());
+    } else {
+      res.set_content("status " + std::to_string(f.status) + "\n", "text/plain");
+    }
     return;
   }
   if (!signature_valid(query, key)) {
