@@ -1,0 +1,92 @@
+// Test harness for the stand-in servers: RAII owners that start
+// sitedeck-content-server or sitedeck-geocoder on a kernel-chosen port, read
+// the port from the server's first stdout line (bounded wait), change its
+// fault settings through its control route, read its request counters, and
+// stop and reap it when they go. Also a small blocking HTTP GET for tests.
+// Settings and counters are listed in docs/stand-in-servers.md.
+#pragma once
+
+#include <sys/types.h>
+
+#include <map>
+#include <string>
+#include <utility>
+#include <vector>
+
+struct HttpAnswer {
+  int curl_code = -1;  // CURLcode of the transfer; 0 when it completed
+  long status = 0;     // HTTP status, 0 when none was received
+  std::string head;    // every header line as received, status lines included
+  std::string body;    // at most HttpRequest::max_body bytes
+  // Value of the first header line named exactly `name` (case matters), or "".
+  std::string header(const std::string& name) const;
+  bool has_header(const std::string& name) const;
+};
+
+struct HttpRequest {
+  std::vector<std::string> headers;    // extra "Name: value" lines
+  long timeout_ms = 10000;             // whole transfer
+  size_t max_body = 16 * 1024 * 1024;  // a longer body aborts the transfer (CURLE_WRITE_ERROR)
+};
+
+// One GET of `url`; never follows redirects.
+HttpAnswer http_get(const std::string& url, const HttpRequest& request = HttpRequest());
+
+// Lower-case hex MD5 of `query` + `key`: the item-list signature, computed
+// with GLib rather than the service's own routine.
+std::string stand_in_signature(const std::string& query,
+                               const std::string& key = "SITEDECKTESTKEY0123456789ABCDEFG");
+
+class StandInProcess {
+ public:
+  StandInProcess(const StandInProcess&) = delete;
+  StandInProcess& operator=(const StandInProcess&) = delete;
+  // Sends SIGTERM, waits up to 10 s for the exit, then SIGKILL; always reaps.
+  ~StandInProcess();
+
+  // False when the binary could not be started or announced no port in 10 s.
+  bool ok() const { return port_ > 0; }
+  int port() const { return port_; }
+  pid_t pid() const { return pid_; }
+  std::string root_url() const;  // "http://127.0.0.1:PORT"
+
+  // Applies settings through /_control/set (values are URL-escaped here).
+  // True when the server accepted all of them.
+  bool control(const std::vector<std::pair<std::string, std::string>>& settings) const;
+  // Back to the start-up settings and catalogue, counters zeroed, stalls released.
+  bool reset() const;
+  // Ends every stalled body and pending delay now.
+  bool release() const;
+  // The counters of /_control/stats by name; empty when unreachable.
+  std::map<std::string, std::string> stats() const;
+
+ protected:
+  StandInProcess(const char* binary, const std::vector<std::string>& args);
+
+ private:
+  pid_t pid_ = -1;
+  int port_ = 0;
+};
+
+// sitedeck-content-server with the sample catalogue (or `args`, e.g. {"--items", "500"}).
+class ContentServerProcess : public StandInProcess {
+ public:
+  explicit ContentServerProcess(const std::vector<std::string>& args = {});
+  // "http://127.0.0.1:PORT/SiteDeck/getSubRegionalItems"
+  std::string base_url() const;
+  // base_url() + "?" + query + "&hash=" + signature of query: what the service sends.
+  std::string signed_url(const std::string& query) const;
+  // "http://127.0.0.1:PORT/icons/" + file
+  std::string icon_url(const std::string& file) const;
+};
+
+class GeocoderProcess : public StandInProcess {
+ public:
+  explicit GeocoderProcess(const std::vector<std::string>& args = {});
+  // "http://127.0.0.1:PORT/6.2/reversegeocode.xml"
+  std::string base_url() const;
+  // The full request for a position text such as "37.500000,127.000000".
+  std::string request_url(const std::string& prox,
+                          const std::string& app_id = "Vb7Qm2Lx9Tr4Kp6Ws1Nd",
+                          const std::string& app_code = "Hk3Pz8Rt_Wm5Yc2Nq7Lv4J") const;
+};
