@@ -38,3 +38,7 @@ int get_sitedeck_item_from_db(int id, sds_item* item);
 
 // Merges a parsed item list into the table, in one transaction.
 int insert_sitedeck_items_in_db(sds_item* head);
+
+// Result of insert_sitedeck_items_in_db when its transaction was rolled back
+// and the table still holds the previous list.
+constexpr int SDS_MERGE_NOT_COMMITTED = -2;
