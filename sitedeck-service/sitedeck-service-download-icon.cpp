@@ -1,0 +1,261 @@
+// Icon download: after an item list is parsed, each item keeps one chosen touch
+// icon, fetched into the images directory when it differs from the stored one,
+// or no icon at all. Downloads run a few at a time over reused connections;
+// the outcome per item is the same as fetching them one by one in list order.
+#include "sitedeck-service-download-icon.h"
+
+#include <curl/curl.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "database/sitedeck-service-db-interface.h"
+#include "sitedeck-service-log.h"
+#include "sitedeck-service-raii.h"
+#include "sitedeck-service-request-server.h"
+#include "sitedeck-service-transfer-limits.h"
+#include "sitedeck-service-utils.h"
+
+namespace {
+
+// Enough parallel fetches to hide a slow server's latency without hammering it.
+constexpr int kMaxParallelDownloads = 6;
+
+struct CurlEasyDeleter {
+  void operator()(CURL* c) const noexcept { curl_easy_cleanup(c); }
+};
+using UniqueCurl = std::unique_ptr<CURL, CurlEasyDeleter>;
+struct CurlMultiDeleter {
+  void operator()(CURLM* m) const noexcept { (void)curl_multi_cleanup(m); }
+};
+using UniqueCurlMulti = std::unique_ptr<CURLM, CurlMultiDeleter>;
+
+// One icon file being written; refuses to grow past the icon size limit.
+struct IconSink {
+  UniqueFile file;
+  size_t written = 0;
+};
+
+size_t write_icon_block(char* data, size_t size, size_t count, void* user) {
+  auto* sink = static_cast<IconSink*>(user);
+  size_t bytes = size * count;
+  if (sink->written + bytes > SDS_MAX_ICON_BYTES) return 0;  // aborts the transfer
+  size_t items = std::fwrite(data, size, count, sink->file.get());
+  sink->written += items * size;
+  return items;
+}
+
+// One transfer: the icon, its target file and the texts the handle points at.
+struct IconTransfer {
+  sds_icon* icon = nullptr;
+  UniqueCurl curl;
+  IconSink sink;
+  UniqueCStr user_agent;
+  UniqueCStr proxy;
+  bool done = false;
+  bool ok = false;
+};
+
+// Prepares a transfer of `icon` into its file; false when it cannot start.
+bool prepare_transfer(sds_icon* icon, IconTransfer* transfer) {
+  transfer->icon = icon;
+  transfer->curl.reset(curl_easy_init());
+  UniqueCStr path(get_icon_path(icon->icon_path));
+  if (!transfer->curl || !path) return false;
+  transfer->sink.file.reset(std::fopen(path.get(), "wb"));
+  if (!transfer->sink.file) {
+    SDS_LOGE("[CRITICAL]  Unable to open Image File");
+    return false;
+  }
+  CURL* curl = transfer->curl.get();
+  char* user_agent = nullptr;
+  char* proxy = nullptr;
+  int code = sds_transfer_apply_settings(curl, &user_agent, &proxy);
+  transfer->user_agent.reset(user_agent);
+  transfer->proxy.reset(proxy);
+  if (code != SDS_ERROR_NONE) return false;
+  (void)curl_easy_setopt(curl, CURLOPT_URL, icon->icon_path);
+  (void)curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, write_icon_block);
+  (void)curl_easy_setopt(curl, CURLOPT_WRITEDATA, &transfer->sink);
+  (void)curl_easy_setopt(curl, CURLOPT_MAXFILESIZE_LARGE,
+                         static_cast<curl_off_t>(SDS_MAX_ICON_BYTES));
+  return true;
+}
+
+// Checks a finished transfer the way a single download is judged.
+bool finish_transfer(IconTransfer* transfer, CURLcode result) {
+  if (result != CURLE_OK) {
+    SDS_LOGE("[CRITICAL] Failed to perform easy perfomr[%d] \n", static_cast<int>(result));
+    return false;
+  }
+  long status = 0;
+  CURLcode info = curl_easy_getinfo(transfer->curl.get(), CURLINFO_RESPONSE_CODE, &status);
+  if (info != CURLE_OK) {
+    SDS_LOGE("[CRITICAL] curl_easy_getinfo Failed: CURLINFO_HTTP_CODE with error code[%d] \n",
+             static_cast<int>(info));
+    return false;
+  }
+  curl_off_t downloaded = 0;
+  info = curl_easy_getinfo(transfer->curl.get(), CURLINFO_SIZE_DOWNLOAD_T, &downloaded);
+  if (info != CURLE_OK) {
+    SDS_LOGE("[CRITICAL] curl_easy_getinfo Failed : CURLINFO_SIZE_DOWNLOAD with error code[%d]",
+             static_cast<int>(info));
+    return false;
+  }
+  // The status is not judged here: a body that is no PNG is refused when stored.
+  return std::fclose(transfer->sink.file.release()) == 0;
+}
+
+// Runs the transfers, at most kMaxParallelDownloads at a time.
+void run_transfers(std::vector<std::unique_ptr<IconTransfer>>& transfers) {
+  UniqueCurlMulti multi(curl_multi_init());
+  if (!multi) return;
+  (void)curl_multi_setopt(multi.get(), CURLMOPT_MAX_TOTAL_CONNECTIONS,
+                          static_cast<long>(kMaxParallelDownloads));
+  std::map<CURL*, IconTransfer*> by_handle;
+  size_t next = 0;
+  int running = 0;
+  auto add_more = [&] {
+    while (next < transfers.size() && static_cast<int>(by_handle.size()) < kMaxParallelDownloads) {
+      IconTransfer* t = transfers[next++].get();
+      if (curl_multi_add_handle(multi.get(), t->curl.get()) == CURLM_OK) {
+        by_handle[t->curl.get()] = t;
+      } else {
+        t->done = true;
+      }
+    }
+  };
+  add_more();
+  while (!by_handle.empty()) {
+    if (curl_multi_perform(multi.get(), &running) != CURLM_OK) break;
+    int queued = 0;
+    while (CURLMsg* msg = curl_multi_info_read(multi.get(), &queued)) {
+      if (msg->msg != CURLMSG_DONE) continue;
+      auto found = by_handle.find(msg->easy_handle);
+      if (found == by_handle.end()) continue;
+      IconTransfer* t = found->second;
+      t->done = true;
+      t->ok = finish_transfer(t, msg->data.result);
+      (void)curl_multi_remove_handle(multi.get(), msg->easy_handle);
+      by_handle.erase(found);
+    }
+    add_more();
+    if (by_handle.empty()) break;
+    if (curl_multi_poll(multi.get(), nullptr, 0, 1000, nullptr) != CURLM_OK) break;
+  }
+  for (auto& [handle, t] : by_handle) (void)curl_multi_remove_handle(multi.get(), handle);
+}
+
+// True when the stored icon of `site_url` has this path and time stamp.
+bool icon_unchanged(const char* site_url, const sds_icon* icon) {
+  char* stored_path = nullptr;
+  bool same = false;
+  if (sds_get_string_for_url_from_db(site_url, &stored_path, "icon_path") == SDS_ERROR_NONE &&
+      stored_path != nullptr && icon->icon_path != nullptr &&
+      std::strcmp(stored_path, icon->icon_path) == 0) {
+    char* stored_stamp = nullptr;
+    if (sds_get_string_for_url_from_db(site_url, &stored_stamp, "image_last_updated") ==
+            SDS_ERROR_NONE &&
+        stored_stamp != nullptr && std::strcmp(stored_stamp, icon->last_modified) == 0) {
+      same = true;
+    }
+    std::free(stored_stamp);
+  }
+  std::free(stored_path);
+  return same;
+}
+
+void drop_icons(sds_item* item) {
+  sds_free_icon_list(&item->ps_sds_icon_list);
+  item->ps_sds_icon_list = nullptr;
+}
+
+}  // namespace
+
+sds_icon* sds_choose_icon(sds_icon* head) {
+  sds_icon* administered = nullptr;
+  sds_icon* other = nullptr;
+  for (sds_icon* icon = head; icon != nullptr; icon = icon->next) {
+    sds_icon*& best = icon->is_administered ? administered : other;
+    if (best == nullptr || std::atoi(icon->icon_size) > std::atoi(best->icon_size)) best = icon;
+  }
+  return administered != nullptr ? administered : other;
+}
+
+void sds_keep_only_icon(sds_icon** head, sds_icon* chosen) {
+  if (head == nullptr) return;
+  sds_icon* icon = *head;
+  while (icon != nullptr) {
+    sds_icon* next = icon->next;
+    if (icon != chosen) {
+      std::free(icon->icon_path);
+      std::free(icon);
+    }
+    icon = next;
+  }
+  if (chosen != nullptr) chosen->next = nullptr;
+  *head = chosen;
+}
+
+int sds_download_icon(sds_icon* icon) {
+  if (icon == nullptr) return -1;
+  sds_transfer_global_init();
+  std::vector<std::unique_ptr<IconTransfer>> transfers;
+  transfers.push_back(std::make_unique<IconTransfer>());
+  if (!prepare_transfer(icon, transfers.back().get())) return -1;
+  run_transfers(transfers);
+  return transfers.back()->ok ? 0 : -1;
+}
+
+int sds_get_sitedeck_icons(sds_item** head) {
+  if (head == nullptr) return 0;
+  sds_transfer_global_init();
+  // First decide, item by item, what to fetch; then fetch; then prune.
+  std::vector<std::pair<sds_item*, IconTransfer*>> pending;
+  std::vector<std::unique_ptr<IconTransfer>> transfers;
+  std::map<std::string, IconTransfer*> by_url;
+  int result = 0;
+  for (sds_item* item = *head; item != nullptr; item = item->next) {
+    if (item->ps_sds_icon_list == nullptr) continue;
+    if (item->is_specially_removed) {
+      SDS_LOGE("Item is specially removed from server, hence no need to download Icon");
+      drop_icons(item);
+      continue;
+    }
+    sds_icon* chosen = sds_choose_icon(item->ps_sds_icon_list);
+    if (item->site_url != nullptr && icon_unchanged(item->site_url, chosen)) {
+      SDS_LOGE("Icon last modified time is not changed so not downloading icon");
+      drop_icons(item);
+      continue;
+    }
+    sds_keep_only_icon(&item->ps_sds_icon_list, chosen);
+    IconTransfer* transfer = nullptr;
+    std::string url = chosen->icon_path != nullptr ? chosen->icon_path : "";
+    auto same_url = by_url.find(url);
+    if (!url.empty() && same_url != by_url.end()) {
+      transfer = same_url->second;  // one file serves every item naming this URL
+    } else {
+      transfers.push_back(std::make_unique<IconTransfer>());
+      transfer = transfers.back().get();
+      if (!prepare_transfer(chosen, transfer)) transfer->done = true;
+      if (!url.empty()) by_url[url] = transfer;
+    }
+    pending.emplace_back(item, transfer);
+  }
+  std::vector<std::unique_ptr<IconTransfer>> startable;
+  std::vector<std::unique_ptr<IconTransfer>> finished;
+  for (auto& t : transfers) (t->done ? finished : startable).push_back(std::move(t));
+  run_transfers(startable);
+  for (auto& [item, transfer] : pending) {
+    if (!transfer->ok) {
+      SDS_LOGE("[CRITICAL]  Failed to Download the Icon");
+      drop_icons(item);
+      result = -1;
+    }
+  }
+  return result;
+}
