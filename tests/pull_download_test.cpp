@@ -236,6 +236,30 @@ TEST_F(PullDownload, FailedIconKeepsTheOldEtagAndAsksAgainInADay) {
   EXPECT_EQ(first_pixel_hex(kHerald), bgra_hex("#39D7D7"));  // touched: colours inverted
 }
 
+// The ETag of a list whose merge was rolled back named a list never stored,
+// so the next request got 304 and the list was never fetched again.
+TEST_F(PullDownload, EtagOfAListTheMergeRolledBackWasKept) {
+  ASSERT_EQ(pull(), SDS_ERROR_NONE);
+  const std::string before = table();
+  const std::string etag = root_file_or_none(SDS_ETAG_PATH);
+  ASSERT_TRUE(content_.control({{"remove", kGarden}}));
+  // Another writer holds the database past the merge's busy time-out.
+  sqlite3* writer = nullptr;
+  ASSERT_EQ(sqlite3_open(db_.db_path().c_str(), &writer), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(writer, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr), SQLITE_OK);
+  EXPECT_EQ(pull(), SDS_ERROR_NONE);
+  (void)sqlite3_exec(writer, "ROLLBACK", nullptr, nullptr, nullptr);
+  sqlite3_close(writer);
+  EXPECT_EQ(table(), before);
+  EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), etag);
+  EXPECT_EQ(images_left(), 0);
+
+  EXPECT_EQ(pull(), SDS_ERROR_NONE);
+  EXPECT_EQ(DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) +
+                            "'"),
+            "0");
+}
+
 TEST_F(PullDownload, AnswerWithoutEtagDeletesTheStoredOne) {
   ASSERT_EQ(pull(), SDS_ERROR_NONE);
   ASSERT_NE(root_file_or_none(SDS_ETAG_PATH), "<none>");
