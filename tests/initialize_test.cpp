@@ -90,14 +90,16 @@ TEST_F(Initialize, FullExchangeRunsThePullAndTheListCanBeRead) {
   std::string listed;
   for (int id : sorted) listed += (listed.empty() ? "" : "\n") + std::to_string(id);
   // Every site but the one the server withdrew.
-  EXPECT_EQ(listed, rows_of_file(db, "SELECT id FROM site_deck WHERE url != "
-                                     "'http://old-portal.example/' ORDER BY id"));
+  EXPECT_EQ(listed, rows_of_file(db,
+                                 "SELECT id FROM site_deck WHERE url != "
+                                 "'http://old-portal.example/' ORDER BY id"));
   for (int id : ids) {
     EXPECT_EQ(url_of(connection, id),
               rows_of_file(db, "SELECT url FROM site_deck WHERE id = " + std::to_string(id)));
   }
-  EXPECT_NE(rows_of_file(db, "SELECT count(*) FROM site_deck WHERE url = "
-                             "'http://joburg-news.example/'"),
+  EXPECT_NE(rows_of_file(db,
+                         "SELECT count(*) FROM site_deck WHERE url = "
+                         "'http://joburg-news.example/'"),
             "0");
   connection.close();
   int status = 0;

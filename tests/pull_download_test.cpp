@@ -138,7 +138,8 @@ TEST_F(PullDownload, CacheControlWithoutAPositiveMaxAgeWritesNoDuration) {
       EXPECT_TRUE(log.contains(c.logged)) << c.value;
     } else {
       for (const LogLine& line : log.lines()) {
-        EXPECT_EQ(line.message.rfind("Next update duration:", 0), std::string::npos) << line.message;
+        EXPECT_EQ(line.message.rfind("Next update duration:", 0), std::string::npos)
+            << line.message;
       }
     }
   }
@@ -225,8 +226,9 @@ TEST_F(PullDownload, FailedIconKeepsTheOldEtagAndAsksAgainInADay) {
   EXPECT_TRUE(log.contains("[CRITICAL]  Failed to Download the Icon"));
   EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), etag);
   EXPECT_EQ(root_file_or_none(SDS_NEXT_UPDATE_DURATION_PATH), "86400");
-  EXPECT_EQ(DbSession::rows("SELECT count(*) FROM site_deck WHERE url = 'http://garden-life.example/'"),
-            "0");
+  EXPECT_EQ(
+      DbSession::rows("SELECT count(*) FROM site_deck WHERE url = 'http://garden-life.example/'"),
+      "0");
   EXPECT_EQ(first_pixel_hex(kHerald), herald_pixel);
 
   ASSERT_EQ(rmdir(icon_file.get()), 0);
@@ -255,9 +257,9 @@ TEST_F(PullDownload, EtagOfAListTheMergeRolledBackWasKept) {
   EXPECT_EQ(images_left(), 0);
 
   EXPECT_EQ(pull(), SDS_ERROR_NONE);
-  EXPECT_EQ(DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) +
-                            "'"),
-            "0");
+  EXPECT_EQ(
+      DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) + "'"),
+      "0");
 }
 
 TEST_F(PullDownload, AnswerWithoutEtagDeletesTheStoredOne) {
@@ -294,9 +296,9 @@ TEST_F(PullDownload, SitesWhoseIconFilesShareANameEachKeepTheirOwnPixels) {
   EXPECT_EQ(centre_pixel_hex(kWeather), bgra_hex("#EA9A3F", "80"));
   EXPECT_EQ(first_pixel_hex(kShop), bgra_hex("#2E7D32"));
   EXPECT_EQ(centre_pixel_hex(kShop), bgra_hex("#D182CD"));
-  EXPECT_EQ(DbSession::rows("SELECT icon_path FROM site_deck WHERE url = '" + std::string(kShop) +
-                            "'"),
-            content_.icon_url("shop-central/icons/apple-touch-icon.png"));
+  EXPECT_EQ(
+      DbSession::rows("SELECT icon_path FROM site_deck WHERE url = '" + std::string(kShop) + "'"),
+      content_.icon_url("shop-central/icons/apple-touch-icon.png"));
 }
 
 // The icon was fetched once for both sites, and storing the first site's
@@ -373,9 +375,9 @@ TEST_F(PullDownload, ServiceKilledInTheMiddleOfTheMergeLeavesThePreviousTable) {
   sqlite3* reader = nullptr;
   ASSERT_EQ(sqlite3_open_v2(db_.db_path().c_str(), &reader, SQLITE_OPEN_READONLY, nullptr),
             SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(reader, "BEGIN; SELECT count(*) FROM site_deck;", nullptr, nullptr,
-                         nullptr),
-            SQLITE_OK);
+  ASSERT_EQ(
+      sqlite3_exec(reader, "BEGIN; SELECT count(*) FROM site_deck;", nullptr, nullptr, nullptr),
+      SQLITE_OK);
   UniqueFd watch(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
   ASSERT_TRUE(watch);
   ASSERT_GE(inotify_add_watch(watch.get(), sds_path(SDS_DATABASE_DIR).c_str(), IN_CREATE), 0);
@@ -398,9 +400,9 @@ TEST_F(PullDownload, ServiceKilledInTheMiddleOfTheMergeLeavesThePreviousTable) {
   EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), etag);
   EXPECT_EQ(pull(), SDS_ERROR_NONE);
   EXPECT_EQ(stat("last_if_none_match") + "\r\n", etag);
-  EXPECT_EQ(DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) +
-                            "'"),
-            "0");
+  EXPECT_EQ(
+      DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) + "'"),
+      "0");
   EXPECT_EQ(first_pixel_hex(kHerald), bgra_hex("#39D7D7"));
 }
 

@@ -47,7 +47,8 @@ class PullJob : public ::testing::Test {
 
 TEST_F(PullJob, FailingServerGetsItsAttemptsWithWaitsThenTheFallBackServerIsAsked) {
   ASSERT_TRUE(a_.control({{"status", "503"}}));
-  ASSERT_TRUE(write_server_list({{1, a_.base_url(), 1200, 3, false}, {2, b_.base_url(), 0, 1, true}}));
+  ASSERT_TRUE(
+      write_server_list({{1, a_.base_url(), 1200, 3, false}, {2, b_.base_url(), 0, 1, true}}));
   LogCapture log;
   EXPECT_EQ(sds_check_data_pull_required(nullptr), SDS_ERROR_NONE);
   EXPECT_EQ(requests(a_), "3");
@@ -60,10 +61,11 @@ TEST_F(PullJob, FailingServerGetsItsAttemptsWithWaitsThenTheFallBackServerIsAske
       waits.push_back(line.message);
     }
   }
-  const std::string waiting = "Server Request Failed so waiting (1200) milliseconds before next reqest";
-  EXPECT_EQ(waits, (std::vector<std::string>{waiting, "Remaining retries = 2", waiting,
-                                             "Remaining retries = 1", waiting,
-                                             "Remaining retries = 0"}));
+  const std::string waiting =
+      "Server Request Failed so waiting (1200) milliseconds before next reqest";
+  EXPECT_EQ(waits,
+            (std::vector<std::string>{waiting, "Remaining retries = 2", waiting,
+                                      "Remaining retries = 1", waiting, "Remaining retries = 0"}));
   EXPECT_NE(rows(), "0");
 }
 
@@ -73,7 +75,8 @@ TEST_F(PullJob, NegativeWaitTimeMeansNoPause) {
   LogCapture log;
   EXPECT_EQ(sds_check_data_pull_required(nullptr), SDS_ERROR_SERVER_REQUEST_FAILED);
   EXPECT_EQ(requests(a_), "2");
-  EXPECT_EQ(log.count("Server Request Failed so waiting (-2000) milliseconds before next reqest"), 2);
+  EXPECT_EQ(log.count("Server Request Failed so waiting (-2000) milliseconds before next reqest"),
+            2);
 }
 
 TEST_F(PullJob, FirstServerNotModifiedEndsThePullWithoutAskingTheNext) {
@@ -138,14 +141,16 @@ TEST_F(PullJob, PermanentRedirectsWithoutEndStopRewritingTheList) {
 
 TEST_F(PullJob, RedirectWithoutLocationIsAFailedAttempt) {
   ASSERT_TRUE(a_.control({{"status", "302"}, {"location", ""}}));
-  ASSERT_TRUE(write_server_list({{1, a_.base_url(), 0, 2, false}, {2, b_.base_url(), 0, 1, false}}));
+  ASSERT_TRUE(
+      write_server_list({{1, a_.base_url(), 0, 2, false}, {2, b_.base_url(), 0, 1, false}}));
   EXPECT_EQ(sds_check_data_pull_required(nullptr), SDS_ERROR_NONE);
   EXPECT_EQ(requests(a_), "2");
   EXPECT_EQ(requests(b_), "1");
 }
 
 TEST_F(PullJob, FirstEntryWithoutAttemptsEndsThePullUnasked) {
-  ASSERT_TRUE(write_server_list({{1, a_.base_url(), 0, 0, false}, {2, b_.base_url(), 0, 1, false}}));
+  ASSERT_TRUE(
+      write_server_list({{1, a_.base_url(), 0, 0, false}, {2, b_.base_url(), 0, 1, false}}));
   EXPECT_EQ(sds_check_data_pull_required(nullptr), SDS_ERROR_DATA_PULL_FAILED);
   EXPECT_EQ(requests(a_), "0");
   EXPECT_EQ(requests(b_), "0");
@@ -202,7 +207,8 @@ TEST_F(PullJob, LocationStepDecidesTheQuery) {
   } cases[] = {
       {"known place", -26.2041, 28.0473, false, nullptr,
        "platform=Valto&city=Johannesburg&province=Gauteng&browserversion=2.0&", "1"},
-      {"failed location step", 37.5, 127.0, false, "503", "platform=Valto&browserversion=2.0&", "1"},
+      {"failed location step", 37.5, 127.0, false, "503", "platform=Valto&browserversion=2.0&",
+       "1"},
       {"latitude out of range", 90.000001, 28.0473, false, nullptr,
        "platform=Valto&browserversion=2.0&", "0"},
       {"longitude not a number", 10.0, std::nan(""), false, nullptr,

@@ -119,7 +119,8 @@ TEST(TransferSettings, ProxyAddressesThatNameAProxyCarryTheRequest) {
   const std::string port = std::to_string(probe.port());
   for (const std::string& address : {"127.0.0.1:" + port, "http://127.0.0.1:" + port}) {
     ASSERT_TRUE(kdb_write(kProxyKey, address.c_str()));
-    auto pull = std::async(std::launch::async, [&] { return sds_download_and_parse_json_data(url.c_str()); });
+    auto pull = std::async(std::launch::async,
+                           [&] { return sds_download_and_parse_json_data(url.c_str()); });
     std::string head = probe.serve_one();
     EXPECT_EQ(pull.get(), SDS_ERROR_SERVER_REQUEST_FAILED) << address;
     EXPECT_EQ(request_line(head), "GET " + url + " HTTP/1.1") << address;

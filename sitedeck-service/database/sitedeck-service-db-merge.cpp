@@ -5,7 +5,6 @@
 // process nor a crash ever sees a half-merged table; within it, one item's
 // failing step does not stop the others.
 #include <sqlite3.h>
-
 #include <unistd.h>
 
 #include <cstdlib>

@@ -47,11 +47,14 @@ std::string pixel_hex(const std::string& url, bool centre) {
     long height = x != nullptr ? std::atol(x + 1) : 0;
     offset = ((height / 2) * width + width / 2) * 4;
   }
-  return DbSession::rows("SELECT CASE WHEN icon_data IS NULL THEN 'NULL' ELSE hex(substr(icon_data, " +
-                         std::to_string(offset + 1) + ", 4)) END" + where);
+  return DbSession::rows(
+      "SELECT CASE WHEN icon_data IS NULL THEN 'NULL' ELSE hex(substr(icon_data, " +
+      std::to_string(offset + 1) + ", 4)) END" + where);
 }
 
-bool send_int(int fd, int32_t value) { return sds_ipc_send_custom_type(fd, &value, sizeof value) == 0; }
+bool send_int(int fd, int32_t value) {
+  return sds_ipc_send_custom_type(fd, &value, sizeof value) == 0;
+}
 
 // Sends command 1; reads the two intermediate statuses into `reply` if given.
 bool exchange_initialize(int fd, int cid, double latitude, double longitude, int flag,

@@ -34,9 +34,9 @@ std::string centre_pixel_hex(const std::string& url);
 std::string bgra_hex(const char* rgb, const char* alpha = "FF");
 
 struct InitializeReply {
-  int ready = -1;      // status after the header
-  int received = -1;   // status after the position
-  int final = -1;      // the pull's result
+  int ready = -1;     // status after the header
+  int received = -1;  // status after the position
+  int final = -1;     // the pull's result
 };
 
 // Runs command 1 on a connected socket: position, then the flag and, when
