@@ -104,7 +104,7 @@ TEST_F(Initialize, FullExchangeRunsThePullAndTheListCanBeRead) {
   connection.close();
   int status = 0;
   ASSERT_TRUE(service.wait_exit(&status));
-  EXPECT_EQ(exit_code_of(status), 0);
+  EXPECT_EQ(exit_code_of(status), 0) << service.output();
 }
 
 TEST_F(Initialize, VersionAndPositionChecks) {
