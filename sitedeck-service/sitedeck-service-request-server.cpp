@@ -226,6 +226,9 @@ int sds_download_and_parse_json_data(const char* url) {
   (void)curl_easy_setopt(c, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_1_1));
 
   (void)remove_file(sds_path(SDS_NEXT_UPDATE_DURATION_PATH).c_str());
+  // A pending ETag left by a pull that was killed belongs to a list that was
+  // never stored; an answer without an ETag must not commit it.
+  (void)std::remove(pending_etag_path.c_str());
 
   CURLcode performed = curl_easy_perform(c);
   if (performed != CURLE_OK) {
@@ -248,12 +251,15 @@ int sds_download_and_parse_json_data(const char* url) {
   (void)remove_file(body_path.c_str());
 
   if (sds_item_list_head != nullptr) {
+    // A parse cut short (out of memory) still stores what it got, but that
+    // list is not the one the ETag names.
+    const bool whole_list = sds_last_error == SDS_ERROR_HTTP_OK;
     int icons = sds_get_sitedeck_icons(&sds_item_list_head);
     if (icons != 0) sds_set_next_update_duration(SDS_DEFAULT_UPDATE_SECONDS);
     int merged = insert_sitedeck_items_in_db(sds_item_list_head);
     // The ETag names the list now in the database; committing it any earlier
     // would leave it behind for a list a cut-off pull never stored.
-    if (icons == 0 && merged != SDS_MERGE_NOT_COMMITTED) {
+    if (whole_list && icons == 0 && merged != SDS_MERGE_NOT_COMMITTED) {
       (void)remove_file(etag_path.c_str());
       // No pending ETag (the answer had none) leaves no stored one either.
       if (std::rename(pending_etag_path.c_str(), etag_path.c_str()) != 0 && errno != ENOENT) {

@@ -157,7 +157,11 @@ int sds_get_blob_from_db(int id, int* length, int* height, int* width, unsigned 
   return SDS_ERROR_NONE;
 }
 
-int update_sitedeck_icon_to_db(int id, sds_item* item) {
+namespace {
+
+// Checks the item and stores its one icon from the icon file; the path of
+// that file goes to `*path` (null when there is none) for the caller to remove.
+int store_item_icon(int id, const sds_item* item, UniqueCStr* path) {
   if (item == nullptr) {
     SDS_LOGE("NULL check::item");
     return SDS_ERROR_INVALID_PARAMETER;
@@ -171,12 +175,24 @@ int update_sitedeck_icon_to_db(int id, sds_item* item) {
     return SDS_ERROR_INVALID_PARAMETER;
   }
   const sds_icon* icon = item->ps_sds_icon_list;
-  UniqueCStr path(get_icon_path(icon->icon_path));
-  if (!path) {
+  path->reset(get_icon_path(icon->icon_path));
+  if (!*path) {
     SDS_LOGE("NULL check::icon_path");
     return SDS_ERROR_INVALID_PARAMETER;
   }
-  int code = store_icon_file(id, icon, path.get());
-  (void)remove_file(path.get());
+  return store_icon_file(id, icon, path->get());
+}
+
+}  // namespace
+
+int update_sitedeck_icon_to_db(int id, sds_item* item) {
+  UniqueCStr path;
+  int code = store_item_icon(id, item, &path);
+  if (path) (void)remove_file(path.get());
   return code;
+}
+
+int sds_store_sitedeck_icon_keep_file(int id, const sds_item* item) {
+  UniqueCStr path;
+  return store_item_icon(id, item, &path);
 }

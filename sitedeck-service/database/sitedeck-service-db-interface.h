@@ -25,6 +25,10 @@ int update_sitedeck_is_specially_removed(int id, int flag);
 int update_sitedeck_title_to_db(int id, const char* title);
 int update_sitedeck_predominant_color_to_db(int id, const char* color);
 int update_sitedeck_icon_to_db(int id, sds_item* item);
+// As update_sitedeck_icon_to_db, but leaves the icon file where it is: items
+// naming the same icon URL share one downloaded file, so the merge stores
+// every item first and removes the files afterwards.
+int sds_store_sitedeck_icon_keep_file(int id, const sds_item* item);
 int delete_sitedeck_item_from_db(const char* url);
 int get_sitedeck_url_from_db(int id, char** url);
 

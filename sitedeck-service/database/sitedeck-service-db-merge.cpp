@@ -5,6 +5,7 @@
 // process nor a crash ever sees a half-merged table; within it, one item's
 // failing step does not stop the others.
 #include <sqlite3.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <cstring>
@@ -16,6 +17,7 @@
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
+#include "sitedeck-service-utils.h"
 
 namespace {
 
@@ -37,11 +39,11 @@ void merge_item(sds_item* item, int order) {
   int id = sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
   if (id < 0) {
     id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
-    (void)update_sitedeck_icon_to_db(id, item);
+    (void)sds_store_sitedeck_icon_keep_file(id, item);
     (void)update_sitedeck_order_index_to_db(id, &order);
     (void)update_sitedeck_is_specially_removed(id, item->is_specially_removed);
   } else {
-    (void)update_sitedeck_icon_to_db(id, item);
+    (void)sds_store_sitedeck_icon_keep_file(id, item);
     (void)update_sitedeck_order_index_to_db(id, &order);
     (void)update_sitedeck_title_to_db(id, item->site_name);
     if (item->predominant_color != nullptr) {
@@ -51,6 +53,22 @@ void merge_item(sds_item* item, int order) {
   }
   if (code != SDS_ERROR_NONE) SDS_LOGE("Error :: %s", sds_error_string(code));
 }
+
+// Removes the downloaded icon files of the list once the merge is over,
+// however it ends. Several items may name one icon URL and so one file: it
+// must outlive every item's store, and is removed once.
+struct IconFileSweep {
+  const sds_item* head;
+  ~IconFileSweep() {
+    for (const sds_item* item = head; item != nullptr; item = item->next) {
+      if (item->ps_sds_icon_list == nullptr) continue;
+      const char* url = item->ps_sds_icon_list->icon_path;
+      if (url == nullptr || std::strchr(url, '/') == nullptr) continue;  // never had a file
+      UniqueCStr path(get_icon_path(url));
+      if (path && access(path.get(), F_OK) == 0) (void)remove_file(path.get());
+    }
+  }
+};
 
 // Collects the listed URLs; false when memory ran out.
 bool collect_urls(const sds_item* head, UrlSet* urls) {
@@ -105,6 +123,7 @@ int insert_sitedeck_items_in_db(sds_item* head) {
     SDS_LOGE("NULL check::item");
     return SDS_MERGE_NOT_COMMITTED;
   }
+  IconFileSweep sweep{head};
   if (!run("BEGIN IMMEDIATE")) return SDS_MERGE_NOT_COMMITTED;
 
   int order = 1;
