@@ -93,6 +93,9 @@ int main() {
       std::signal(SIGPIPE, SIG_IGN) == SIG_ERR) {
     SDS_LOGE("failed to register signal callback");
   }
+  // A file that reaches the size limit (a full quota) must fail its write
+  // with EFBIG, which every writer handles, rather than end the process.
+  (void)std::signal(SIGXFSZ, SIG_IGN);
 
   auto* context = new (std::nothrow) sds_server_context{};
   if (context == nullptr) {

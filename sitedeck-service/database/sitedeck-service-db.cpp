@@ -1,8 +1,9 @@
 // The item database file and its one connection: opening an existing file,
-// replacing a file that is not a database, creating a missing one with the
-// `site_deck` table, closing, finalizing statements and mapping SQLite
-// results to SDS codes. It never creates directories; the database directory
-// comes with the installation. The table layout is described in docs/storage.md.
+// replacing a file that is not a database, creating a missing or empty one
+// with the `site_deck` table, dropping the stored ETag while the table holds
+// no item, closing, finalizing statements and mapping SQLite results to SDS
+// codes. It never creates directories; the database directory comes with the
+// installation. The table layout is described in docs/storage.md.
 #include "database/sitedeck-service-db.h"
 
 #include <sqlite3.h>
@@ -40,6 +41,32 @@ int probe_database(sqlite3* db) {
   return rc == SQLITE_ROW || rc == SQLITE_DONE ? SQLITE_OK : rc;
 }
 
+// True when the file holds no schema at all: an empty file, as a creation
+// that could not write its table (a full disk, a crash) leaves it.
+bool has_no_schema(sqlite3* db) {
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(db, "SELECT count(*) FROM sqlite_master", -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  return rc == SQLITE_OK && sqlite3_step(stmt.get()) == SQLITE_ROW &&
+         sqlite3_column_int(stmt.get(), 0) == 0;
+}
+
+// The stored ETag names the list in the table. A table without rows (just
+// created, rebuilt after corruption) holds no list, and a request sent with
+// that ETag would be answered 304 and leave the deck empty until the list
+// changes; without it the next pull fetches the whole list.
+void forget_etag_of_empty_table(sqlite3* db) {
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(db, "SELECT count(*) FROM site_deck", -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  if (rc != SQLITE_OK || sqlite3_step(stmt.get()) != SQLITE_ROW ||
+      sqlite3_column_int(stmt.get(), 0) != 0) {
+    return;
+  }
+  std::string etag = sds_path(SDS_ETAG_PATH);
+  if (unlink(etag.c_str()) == 0) SDS_LOGE("no items stored: the stored ETag is dropped");
+}
+
 // Deletes a database file that can't be used, with its rollback journal, so
 // the fresh file does not inherit a stale journal.
 void delete_database_file(const char* path) {
@@ -56,6 +83,7 @@ int sds_db_open(sqlite3** handle) {
   int error_code = SDS_ERROR_NONE;
   int result = __db_open(path.c_str(), handle, &error_code);
   if (error_code != SDS_ERROR_NONE || *handle == nullptr) SDS_LOGE("errorcode : %d", error_code);
+  if (*handle != nullptr) forget_etag_of_empty_table(*handle);
   return result;
 }
 
@@ -69,6 +97,9 @@ int __db_open(const char* path, sqlite3** handle, int* error_code) {
     // Anything but a file that is no database (a busy lock, say) leaves the
     // file as it is: it is a database and is used unchanged.
     if (rc != SQLITE_NOTADB && rc != SQLITE_CORRUPT) {
+      // A file with tables of its own is used as it is; an empty one would
+      // otherwise stay without the table for good.
+      if (rc == SQLITE_OK && has_no_schema(db)) (void)__rebuild_site_deck_tables(db);
       *handle = db;
       return 0;
     }
