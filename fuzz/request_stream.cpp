@@ -9,9 +9,11 @@
 //
 // Two things are redirected for the fuzzer's sake. The shared-memory object's
 // machine-wide name becomes one of this process's own, so that fuzzing never
-// touches a running service's object. And the geocoder address of command 1
-// names a scheme the transfer library refuses at once, so an initialize runs
-// its whole pull without the network; with no server list it ends with 21.
+// touches a running service's object. And the geocoder and the content
+// server of command 1 are named with a scheme the transfer library refuses at
+// once, so an initialize runs its whole pull without the network (ending
+// with 18) while its request is still built from the fuzzed position and
+// version.
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <sys/mman.h>
@@ -67,6 +69,22 @@ void set_up(void) {
       "  x'0102030405060708090a0b0c0d0e0f10',1),"
       " (2,'http://two.example/','Two',0,NULL,0,1,NULL,NULL,2),"
       " (3,'http://three.example/','',0,'',1,-1,'4096x4096',x'00',3)");
+  // A content server the transfer library refuses at once, so that an
+  // initialize builds its signed request from the fuzzed version and
+  // position; and a stored place for the seeds' position, with characters
+  // the request must escape.
+  const char list[] =
+      "<values><Server><Id>1</Id><Base-url>nonet://content/SiteDeck/getSubRegionalItems"
+      "</Base-url><WaitTime>0</WaitTime><RetryCount>1</RetryCount><FallBack>true</FallBack>"
+      "</Server></values>";
+  fuzz_write_file(fuzz_path(SDS_SERVER_DATA_XML), reinterpret_cast<const uint8_t*>(list),
+                  sizeof list - 1);
+  const char place[] =
+      "<Location><LatitudeLongitude>37.500000,127.000000</LatitudeLongitude>"
+      "<City>Gangnam-gu &amp; &lt;Seoul&gt; ?=#</City><Province>Seoul %2F \xed\x8a\xb9</Province>"
+      "</Location>";
+  fuzz_write_file(fuzz_path(SDS_LOCATION_INFO_PATH), reinterpret_cast<const uint8_t*>(place),
+                  sizeof place - 1);
   const char duration[] = "3600";
   fuzz_write_file(fuzz_path(SDS_NEXT_UPDATE_DURATION_PATH),
                   reinterpret_cast<const uint8_t*>(duration), sizeof duration - 1);
