@@ -203,4 +203,33 @@ TEST(DbOpen, StoredEtagOutlivedTheItemsSoTheNextPullWasAnsweredNotModified) {
   }
 }
 
+TEST(DbSound, DamagedPageOfAnOpenedDatabaseWasKeptForGood) {
+  DbSession db;
+  ASSERT_TRUE(
+      db.exec("INSERT INTO site_deck(url, icon_data) VALUES ('https://a.example/', "
+              "randomblob(20000)), ('https://b.example/', randomblob(20000))"));
+  DbSession::close_handle();
+  // Damage past the first pages: opening the file does not notice it.
+  std::string content = read_file(db.db_path());
+  ASSERT_GT(content.size(), 16384u);
+  content.replace(8192, 4096, std::string(4096, 'Z'));
+  ASSERT_TRUE(write_file(db.db_path(), content));
+  const std::string etag = db.root().path(SDS_ETAG_PATH);
+  ASSERT_TRUE(write_file(etag, "\"v1\"\r\n"));
+  ASSERT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_TRUE(file_exists(etag));
+
+  LogCapture log;
+  EXPECT_EQ(sds_ensure_db_sound(), SDS_ERROR_NONE);
+  EXPECT_TRUE(log.contains("database is damaged: it is made afresh"));
+  EXPECT_EQ(db.rows("SELECT count(*) FROM site_deck"), "0");
+  EXPECT_EQ(db.rows("PRAGMA integrity_check"), "ok");
+  EXPECT_FALSE(file_exists(etag));
+
+  // A sound database is left as it is.
+  ASSERT_TRUE(db.exec("INSERT INTO site_deck(url) VALUES ('https://c.example/')"));
+  EXPECT_EQ(sds_ensure_db_sound(), SDS_ERROR_NONE);
+  EXPECT_EQ(db.rows("SELECT url FROM site_deck"), "https://c.example/");
+}
+
 }  // namespace

@@ -217,14 +217,19 @@ TEST_F(FaultInjection, DatabaseFileOfGarbageIsRebuiltAndTheNextPullRefillsIt) {
   std::string noise(64 * 1024, '\0');
   for (char& c : noise) c = static_cast<char>(random());
 
+  // Damage that shows when the file is opened makes the service rebuild it
+  // at once; damage deeper in the file is found by the next pull.
   const struct {
     const char* name;
     std::string content;
+    bool rebuilt_at_open;
   } cases[] = {
-      {"random bytes", noise},
-      {"a database header over random pages", database.substr(0, 100) + noise},
-      {"a database cut after its first page", database.substr(0, 4096)},
-      {"an empty file", ""},
+      {"random bytes", noise, true},
+      {"a database header over random pages", database.substr(0, 100) + noise, true},
+      {"a database cut after its first page", database.substr(0, 4096), true},
+      {"an empty file", "", true},
+      {"a page in the middle overwritten",
+       database.substr(0, 8192) + noise.substr(0, 4096) + database.substr(12288), false},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
@@ -235,7 +240,10 @@ TEST_F(FaultInjection, DatabaseFileOfGarbageIsRebuiltAndTheNextPullRefillsIt) {
       SdsConnection connection;
       ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE);
       std::vector<int32_t> ids;
-      EXPECT_EQ(request_ids(connection, &ids, true), SDS_ERROR_NO_DATA) << service.output();
+      const int status = request_ids(connection, &ids, true);
+      if (c.rebuilt_at_open) {
+        EXPECT_EQ(status, SDS_ERROR_NO_DATA) << service.output();
+      }
       connection.close();
       expect_normal_exit(&service);
     }

@@ -12,6 +12,10 @@ extern sqlite3* sds_db_handle;
 // Opens sds_db_handle when it is not open yet: SDS_ERROR_NONE or
 // SDS_ERROR_DB_OPEN_FAILED.
 int sds_ensure_db_open(void);
+// As sds_ensure_db_open, but a database found damaged is first deleted and
+// made afresh (empty, so the stored ETag goes too and the next download is
+// a full one). Meant for the start of a data pull, which is about to refill it.
+int sds_ensure_db_sound(void);
 
 int sds_get_string_from_db(int id, char** value, const char* column);
 int sds_get_int_from_db(int id, sds_db_value* value, const char* column);

@@ -87,6 +87,27 @@ int sds_db_open(sqlite3** handle) {
   return result;
 }
 
+bool sds_db_is_sound(sqlite3* handle) {
+  if (handle == nullptr) return true;
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(handle, "PRAGMA quick_check(1)", -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  if (rc == SQLITE_OK) rc = sqlite3_step(stmt.get());
+  if (rc == SQLITE_ROW) {
+    const auto* verdict = reinterpret_cast<const char*>(sqlite3_column_text(stmt.get(), 0));
+    if (verdict != nullptr && std::string(verdict) == "ok") return true;
+    SDS_LOGE("database check: %s", verdict != nullptr ? verdict : "(none)");
+    return false;
+  }
+  const int primary = rc & 0xff;
+  return primary != SQLITE_CORRUPT && primary != SQLITE_NOTADB;
+}
+
+void sds_db_discard(sqlite3* handle) {
+  if (handle != nullptr) (void)sqlite3_close_v2(handle);
+  delete_database_file(sds_path(SDS_DB_PATH).c_str());
+}
+
 int __db_open(const char* path, sqlite3** handle, int* error_code) {
   if (path == nullptr || handle == nullptr || error_code == nullptr) return -1;
   sqlite3* db = nullptr;

@@ -33,6 +33,12 @@ union sds_db_value {
 };
 
 int sds_db_open(sqlite3** handle);
+// True unless SQLite's quick check finds the file damaged (a page that is no
+// valid page, a broken b-tree); a busy or locked file counts as sound.
+bool sds_db_is_sound(sqlite3* handle);
+// Closes `handle` and deletes the database file with its journal, for a
+// database found damaged; the next sds_db_open creates it afresh.
+void sds_db_discard(sqlite3* handle);
 int __db_open(const char* path, sqlite3** handle, int* error_code);
 int __rebuild_site_deck_tables(sqlite3* handle);
 int __check_table(sqlite3* handle, const char* table);
