@@ -1,11 +1,13 @@
 // Icon download: after an item list is parsed, each item keeps one chosen touch
 // icon, fetched into the images directory when it differs from the stored one,
-// or no icon at all. Downloads run a few at a time over reused connections;
-// the outcome per item is the same as fetching them one by one in list order.
+// or no icon at all. Downloads run a few at a time over reused connections,
+// each holding its file and handle only while it runs; the outcome per item
+// is the same as fetching them one by one in list order.
 #include "sitedeck-service-download-icon.h"
 
 #include <curl/curl.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <map>
@@ -50,27 +52,40 @@ size_t write_icon_block(char* data, size_t size, size_t count, void* user) {
 }
 
 // One transfer: the icon, its target file and the texts the handle points at.
+// The file and the handle exist only while the transfer runs.
 struct IconTransfer {
   sds_icon* icon = nullptr;
+  std::string path;
   UniqueCurl curl;
   IconSink sink;
   UniqueCStr user_agent;
   UniqueCStr proxy;
+  bool created = false;  // the file was made, and must go if the transfer fails
   bool done = false;
   bool ok = false;
 };
 
-// Prepares a transfer of `icon` into its file; false when it cannot start.
+// Names the file of `icon`'s transfer; false when it cannot have one.
 bool prepare_transfer(sds_icon* icon, IconTransfer* transfer) {
   transfer->icon = icon;
-  transfer->curl.reset(curl_easy_init());
   UniqueCStr path(get_icon_path(icon->icon_path));
-  if (!transfer->curl || !path) return false;
-  transfer->sink.file.reset(std::fopen(path.get(), "wb"));
+  if (!path) return false;
+  transfer->path = path.get();
+  return true;
+}
+
+// Opens the file and sets up the handle just before the transfer runs: a
+// list of a thousand sites must not hold a thousand files and handles open
+// at once (descriptors run out at 1024, and the database needs some too).
+bool start_transfer(IconTransfer* transfer) {
+  transfer->curl.reset(curl_easy_init());
+  if (!transfer->curl) return false;
+  transfer->sink.file.reset(std::fopen(transfer->path.c_str(), "wb"));
   if (!transfer->sink.file) {
     SDS_LOGE("[CRITICAL]  Unable to open Image File");
     return false;
   }
+  transfer->created = true;
   CURL* curl = transfer->curl.get();
   char* user_agent = nullptr;
   char* proxy = nullptr;
@@ -78,12 +93,23 @@ bool prepare_transfer(sds_icon* icon, IconTransfer* transfer) {
   transfer->user_agent.reset(user_agent);
   transfer->proxy.reset(proxy);
   if (code != SDS_ERROR_NONE) return false;
-  (void)curl_easy_setopt(curl, CURLOPT_URL, icon->icon_path);
+  (void)curl_easy_setopt(curl, CURLOPT_URL, transfer->icon->icon_path);
   (void)curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, write_icon_block);
   (void)curl_easy_setopt(curl, CURLOPT_WRITEDATA, &transfer->sink);
   (void)curl_easy_setopt(curl, CURLOPT_MAXFILESIZE_LARGE,
                          static_cast<curl_off_t>(SDS_MAX_ICON_BYTES));
   return true;
+}
+
+// Releases what a transfer held while it ran; the file of a failed one goes
+// too, so that no partial icon is left in the images directory.
+void end_transfer(IconTransfer* transfer) {
+  transfer->done = true;
+  transfer->sink.file.reset();
+  transfer->curl.reset();
+  transfer->user_agent.reset();
+  transfer->proxy.reset();
+  if (!transfer->ok && transfer->created) (void)std::remove(transfer->path.c_str());
 }
 
 // Checks a finished transfer the way a single download is judged.
@@ -122,10 +148,10 @@ void run_transfers(std::vector<std::unique_ptr<IconTransfer>>& transfers) {
   auto add_more = [&] {
     while (next < transfers.size() && static_cast<int>(by_handle.size()) < kMaxParallelDownloads) {
       IconTransfer* t = transfers[next++].get();
-      if (curl_multi_add_handle(multi.get(), t->curl.get()) == CURLM_OK) {
+      if (start_transfer(t) && curl_multi_add_handle(multi.get(), t->curl.get()) == CURLM_OK) {
         by_handle[t->curl.get()] = t;
       } else {
-        t->done = true;
+        end_transfer(t);
       }
     }
   };
@@ -138,16 +164,19 @@ void run_transfers(std::vector<std::unique_ptr<IconTransfer>>& transfers) {
       auto found = by_handle.find(msg->easy_handle);
       if (found == by_handle.end()) continue;
       IconTransfer* t = found->second;
-      t->done = true;
       t->ok = finish_transfer(t, msg->data.result);
       (void)curl_multi_remove_handle(multi.get(), msg->easy_handle);
       by_handle.erase(found);
+      end_transfer(t);
     }
     add_more();
     if (by_handle.empty()) break;
     if (curl_multi_poll(multi.get(), nullptr, 0, 1000, nullptr) != CURLM_OK) break;
   }
-  for (auto& [handle, t] : by_handle) (void)curl_multi_remove_handle(multi.get(), handle);
+  for (auto& [handle, t] : by_handle) {
+    (void)curl_multi_remove_handle(multi.get(), handle);
+    end_transfer(t);
+  }
 }
 
 // True when the stored icon of `site_url` has this path and time stamp.

@@ -405,4 +405,31 @@ TEST_F(FaultInjection, ServerFaultsGiveTheirStatusesAndTheServiceServesOn) {
   }
 }
 
+TEST_F(FaultInjection, LongListOpenedAFilePerIconAtOnceAndRanOutOfDescriptors) {
+  // 300 sites, each with an icon to fetch, and room for 128 descriptors.
+  ContentServerProcess big({"--items", "300"});
+  ASSERT_TRUE(big.ok());
+  ASSERT_TRUE(::write_server_list({{1, big.base_url()}}));
+  ServiceHarness service;
+  ASSERT_TRUE(service.start_direct_wrapped({"/usr/bin/prlimit", "--nofile=128", "--"}));
+  SdsConnection connection;
+  ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
+  EXPECT_EQ(pull_on(connection), SDS_ERROR_NONE);
+  std::vector<int32_t> ids;
+  ASSERT_EQ(request_ids(connection, &ids), SDS_ERROR_NONE);
+  EXPECT_EQ(ids.size(), 300u);
+  int without_icon = 0;
+  for (int32_t id : ids) {
+    int32_t bytes = 0, width = 0, height = 0;
+    if (request_icon(connection, id, &bytes, &width, &height) != SDS_ERROR_NONE) ++without_icon;
+  }
+  EXPECT_EQ(without_icon, 0);
+  connection.close();
+  expect_normal_exit(&service);
+  EXPECT_FALSE(service.has_message("[CRITICAL]  Unable to open Image File"));
+  // Every icon arrived, so the list counts as stored.
+  EXPECT_TRUE(file_exists(data(SDS_ETAG_PATH)));
+  expect_no_working_files();
+}
+
 }  // namespace
