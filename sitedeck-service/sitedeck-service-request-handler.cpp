@@ -7,6 +7,7 @@
 #include "database/sitedeck-service-db-interface.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
+#include "sitedeck-service-request-handler-internal.h"
 
 namespace {
 
@@ -14,21 +15,48 @@ namespace {
 // writes the whole reply and returns an SDS code; 1 or 7 ends the connection.
 using sds_request_handler = int (*)(sds_client* slot, const sds_command* command);
 
-// Handlers by command number (commands: docs/protocol.md). An empty entry is
-// served like an unknown command until its handler is wired in here.
+int __sds_initialize(sds_client* slot, const sds_command*) { return _initialize(slot->sock); }
+int __sds_release_shm(sds_client* slot, const sds_command*) { return _sds_release_shm(slot); }
+int __sds_get_url(sds_client* slot, const sds_command* c) {
+  return _sds_get_string(slot->sock, c->item_id, "url");
+}
+int __sds_get_title(sds_client* slot, const sds_command* c) {
+  return _sds_get_string(slot->sock, c->item_id, "title");
+}
+int __sds_get_touch_icon_exists(sds_client* slot, const sds_command* c) {
+  return _sds_get_int(slot->sock, c->item_id, "touch_icon_exists");
+}
+int __sds_get_icon_size(sds_client* slot, const sds_command* c) {
+  return _sds_get_string(slot->sock, c->item_id, "icon_size");
+}
+int __sds_get_icon(sds_client* slot, const sds_command* c) {
+  return _sds_get_blob(slot->sock, c->item_id);
+}
+int __sds_get_favicon_exists(sds_client* slot, const sds_command* c) {
+  return _sds_get_int(slot->sock, c->item_id, "favicon_exists");
+}
+int __sds_get_dominant_color(sds_client* slot, const sds_command* c) {
+  return _sds_get_string(slot->sock, c->item_id, "dominant_color");
+}
+int __sds_get_next_update(sds_client* slot, const sds_command*) {
+  return _sds_get_next_update_duration(slot->sock);
+}
+int __sds_get_full_ids(sds_client* slot, const sds_command*) { return _sds_get_full_ids(slot->sock); }
+
+// Handlers by command number (commands: docs/protocol.md).
 constexpr sds_request_handler kHandlers[] = {
     nullptr,  // 0: never reaches the dispatcher (refused with the header)
-    nullptr,  // SDS_CMD_INITIALIZE: _initialize
-    nullptr,  // SDS_CMD_FREE_SHM: _sds_release_shm
-    nullptr,  // SDS_CMD_GET_URL: _sds_get_string "url"
-    nullptr,  // SDS_CMD_GET_TITLE: _sds_get_string "title"
-    nullptr,  // SDS_CMD_GET_TOUCH_ICON_EXISTS: _sds_get_int "touch_icon_exists"
-    nullptr,  // SDS_CMD_GET_ICON_SIZE: _sds_get_string "icon_size"
-    nullptr,  // SDS_CMD_GET_ICON: _sds_get_blob
-    nullptr,  // SDS_CMD_GET_FAVICON_EXISTS: _sds_get_int "favicon_exists"
-    nullptr,  // SDS_CMD_GET_DOMINANT_COLOR: _sds_get_string "dominant_color"
-    nullptr,  // SDS_CMD_GET_NEXT_UPDATE_DURATION: _sds_get_next_update_duration
-    nullptr,  // SDS_CMD_GET_FULL_IDS: _sds_get_full_ids
+    __sds_initialize,             // SDS_CMD_INITIALIZE
+    __sds_release_shm,            // SDS_CMD_FREE_SHM
+    __sds_get_url,                // SDS_CMD_GET_URL
+    __sds_get_title,              // SDS_CMD_GET_TITLE
+    __sds_get_touch_icon_exists,  // SDS_CMD_GET_TOUCH_ICON_EXISTS
+    __sds_get_icon_size,          // SDS_CMD_GET_ICON_SIZE
+    __sds_get_icon,               // SDS_CMD_GET_ICON
+    __sds_get_favicon_exists,     // SDS_CMD_GET_FAVICON_EXISTS
+    __sds_get_dominant_color,     // SDS_CMD_GET_DOMINANT_COLOR
+    __sds_get_next_update,        // SDS_CMD_GET_NEXT_UPDATE_DURATION
+    __sds_get_full_ids,           // SDS_CMD_GET_FULL_IDS
 };
 static_assert(sizeof kHandlers / sizeof kHandlers[0] == SDS_CMD_GET_FULL_IDS + 1,
               "one entry per command number");
