@@ -1,0 +1,130 @@
+// The `sitedeck` command line against the real service under the activator,
+// with a seeded database: the table of `list`, the fields of `show`, the PNG
+// that `icon -o` writes, and how failures and bad usage are reported.
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "sitedeck-service-paths.h"
+#include "sitedeck-service-raii.h"
+#include "sitedeck-service-utils.h"
+#include "support/run_process.h"
+#include "support/seeded_deck.h"
+#include "support/service_harness.h"
+#include "support/temp_root.h"
+
+namespace {
+
+class SitedeckTool : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::vector<SeedItem> items(4);
+    items[0] = {7, "https://news.example/", "News", "#AA0000", "4x3", 1, 1, 1, 1,
+                seed_pixels(4, 3, 7)};
+    items[1] = {3, "https://mail.example/inbox", "Mail", std::nullopt, std::nullopt, 0, 0, 1, 2, {}};
+    items[2] = {9, "https://gone.example/", "Gone", "#000000", std::nullopt, 1, 0, -1, 3, {}};
+    items[3] = {5, "https://five.example/", "A very long title that will not fit the column",
+                "#00FF00", std::nullopt, 0, 1, 1, 4, {}};
+    ASSERT_TRUE(seed_deck(items));
+    ASSERT_TRUE(service_.start_activated(/*once=*/false));
+  }
+
+  ProcessResult sitedeck(const std::vector<std::string>& arguments) {
+    std::vector<std::string> argv = {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "--socket",
+                                     service_.socket_path()};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    return run_process(argv);
+  }
+
+  TempRoot root_;
+  ServiceHarness service_;
+};
+
+TEST_F(SitedeckTool, ListPrintsTheLiveItemsInDeckOrder) {
+  ProcessResult result = sitedeck({"list"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out,
+            "ID  TITLE                             URL                         COLOUR   ICON  FLAGS\n"
+            "7   News                              https://news.example/       #AA0000  4x3   "
+            "touch,favicon\n"
+            "3   Mail                              https://mail.example/inbox  -        -     -\n"
+            "5   A very long title that will n...  https://five.example/       #00FF00  -     "
+            "favicon\n");
+  EXPECT_EQ(result.err, "");
+}
+
+TEST_F(SitedeckTool, ShowPrintsEveryFieldAndNamesWhatIsNotStored) {
+  ProcessResult result = sitedeck({"show", "3"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out,
+            "id:                3\n"
+            "url:               https://mail.example/inbox\n"
+            "title:             Mail\n"
+            "dominant colour:   (none)\n"
+            "icon size:         (none)\n"
+            "touch icon exists: 0\n"
+            "favicon exists:    0\n"
+            "icon pixels:       (none)\n");
+  result = sitedeck({"show", "7"});
+  EXPECT_NE(result.out.find("icon pixels:       4x3, 48 bytes\n"), std::string::npos) << result.out;
+}
+
+TEST_F(SitedeckTool, IconWritesThePixelsBackAsPng) {
+  const std::string path = root_.dir() + "/news.png";
+  ProcessResult result = sitedeck({"icon", "7", "-o", path});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out.rfind(path + ": 4x3, ", 0), 0u) << result.out;
+
+  std::string png = read_file(path);
+  unsigned char* raw = nullptr;
+  int width = 0, height = 0, size = 0;
+  ASSERT_EQ(convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()), png.size(),
+                                    &raw, &width, &height, &size),
+            0);
+  UniqueMalloc<unsigned char> pixels(raw);
+  EXPECT_EQ(width, 4);
+  EXPECT_EQ(height, 3);
+  EXPECT_EQ(std::vector<uint8_t>(raw, raw + size), seed_pixels(4, 3, 7));
+}
+
+TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
+  struct Case {
+    std::vector<std::string> arguments;
+    std::string err;
+  } cases[] = {
+      {{"show", "99"}, "sitedeck: show: SDS_ERROR_ID_NOT_FOUND (8)\n"},
+      {{"icon", "3", "-o", root_.dir() + "/none.png"}, "sitedeck: icon: SDS_ERROR_NO_DATA (6)\n"},
+  };
+  for (const auto& c : cases) {
+    ProcessResult result = sitedeck(c.arguments);
+    ASSERT_TRUE(result.finished) << c.arguments[0];
+    EXPECT_EQ(result.exit_code, 1) << c.arguments[0];
+    EXPECT_EQ(result.err, c.err);
+    EXPECT_EQ(result.out, "") << c.arguments[0];
+  }
+  EXPECT_FALSE(file_exists(root_.dir() + "/none.png"));
+}
+
+TEST_F(SitedeckTool, BadUsageExitsWithTwo) {
+  for (const auto& arguments : std::vector<std::vector<std::string>>{
+           {"icon", "7"}, {"show", "x"}, {"show", "-1"}, {"init", "--lat", "1"}, {"frobnicate"}}) {
+    ProcessResult result = sitedeck(arguments);
+    ASSERT_TRUE(result.finished) << arguments[0];
+    EXPECT_EQ(result.exit_code, 2) << arguments[0] << " " << result.err;
+    EXPECT_EQ(result.out, "") << arguments[0];
+  }
+}
+
+TEST_F(SitedeckTool, NextUpdatePrintsTheSeconds) {
+  ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "7200"));
+  ProcessResult result = sitedeck({"next-update"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out, "7200\n");
+}
+
+}  // namespace
