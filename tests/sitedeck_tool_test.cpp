@@ -6,12 +6,14 @@
 #include <string>
 #include <vector>
 
+#include "kdb.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-utils.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
+#include "support/stand_in_servers.h"
 #include "support/temp_root.h"
 
 namespace {
@@ -125,6 +127,39 @@ TEST_F(SitedeckTool, NextUpdatePrintsTheSeconds) {
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 0) << result.err;
   EXPECT_EQ(result.out, "7200\n");
+}
+
+// A pull through the stand-in servers: the result is printed by name, and
+// "not modified" counts as success as much as a new list does.
+TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
+  TempRoot root;
+  ContentServerProcess content;
+  GeocoderProcess geocoder;
+  ASSERT_TRUE(content.ok() && geocoder.ok());
+  ASSERT_TRUE(kdb_write("db/browser/sitedeck/geocoder_url", geocoder.root_url().c_str()));
+  ASSERT_TRUE(write_file(root.path(SDS_SERVER_DATA_XML),
+                         "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<values><Server><Id>1</Id>"
+                         "<Base-url>" + content.base_url() +
+                             "</Base-url><WaitTime>0</WaitTime><RetryCount>1</RetryCount>"
+                             "<FallBack>false</FallBack></Server></values>\n"));
+  ServiceHarness service;
+  ASSERT_TRUE(service.start_activated(/*once=*/false));
+  const std::string tool = std::string(SITEDECK_BIN_DIR) + "/sitedeck";
+  const std::string socket = service.socket_path();
+  const std::vector<std::string> init = {tool,    "--socket", socket, "init",     "--lat",
+                                         "37.5", "--lon",    "127",  "--version", "9.0"};
+
+  ProcessResult result = run_process(init);
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err << service.output();
+  EXPECT_EQ(result.out, "pull result: SDS_ERROR_NONE (0): a new item list was stored\n");
+  result = run_process({tool, "--socket", socket, "list"});
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_NE(result.out.find("\n1   Daily Herald "), std::string::npos) << result.out;
+
+  result = run_process(init);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out, "pull result: SDS_ERROR_UNKNOWN (17): the stored item list is current\n");
 }
 
 }  // namespace
