@@ -77,5 +77,4 @@ int sds_client_get_next_update_duration(SdsConnection& connection, int32_t* seco
 int sds_client_get_full_ids(SdsConnection& connection, sds_client_ids* ids);
 // Command 11 with the one condition there is: the ids whose is_dirty column
 // equals `is_dirty` (1 live, -1 withdrawn by the server).
-int sds_client_get_ids_by_dirty(SdsConnection& connection, int32_t is_dirty,
-                                sds_client_ids* ids);
+int sds_client_get_ids_by_dirty(SdsConnection& connection, int32_t is_dirty, sds_client_ids* ids);

@@ -29,7 +29,8 @@ int sds_client_read_item(SdsConnection& connection, int32_t id, bool with_icon,
     *field.status = field.read(connection, id, field.value);
     if (!__sds_client_field_ok(*field.status)) return *field.status;
   }
-  item->touch_icon_status = sds_client_get_touch_icon_exists(connection, id, &item->touch_icon_exists);
+  item->touch_icon_status =
+      sds_client_get_touch_icon_exists(connection, id, &item->touch_icon_exists);
   if (!__sds_client_field_ok(item->touch_icon_status)) return item->touch_icon_status;
   item->favicon_status = sds_client_get_favicon_exists(connection, id, &item->favicon_exists);
   if (!__sds_client_field_ok(item->favicon_status)) return item->favicon_status;

@@ -23,7 +23,7 @@ int __sds_client_wait_for_result(int fd, sds_client_wait_fn waiting, void* user,
   for (;;) {
     struct pollfd entry = {fd, POLLIN, 0};
     int ready = poll(&entry, 1, waiting != nullptr ? tick_ms : -1);
-    if (ready > 0) return SDS_ERROR_NONE;  // the status, or the end of the stream
+    if (ready > 0) return SDS_ERROR_NONE;                    // the status, or the end of the stream
     if (ready < 0 && errno != EINTR) return SDS_ERROR_NONE;  // the read reports it
     if (ready == 0 && !waiting(user)) return SDS_ERROR_IO_EINTR;
   }

@@ -33,8 +33,7 @@ int __sds_client_get_text(SdsConnection& connection, int32_t cmd, int32_t item_i
   return SDS_ERROR_NONE;
 }
 
-int __sds_client_get_word(SdsConnection& connection, int32_t cmd, int32_t item_id,
-                          int32_t* out) {
+int __sds_client_get_word(SdsConnection& connection, int32_t cmd, int32_t item_id, int32_t* out) {
   if (out == nullptr || item_id < 0) return SDS_ERROR_INVALID_PARAMETER;
   int status = sds_client_request(connection, cmd, item_id);
   if (status != SDS_ERROR_NONE) return __sds_client_status_ends(connection, status);
@@ -78,8 +77,8 @@ int __sds_client_get_ids(SdsConnection& connection, const unsigned char* conditi
       connection.close();
       return SDS_ERROR_OUT_OF_MEMORY;
     }
-    result =
-        __sds_client_read_exact(connection, ids.get(), static_cast<size_t>(count) * sizeof(int32_t));
+    result = __sds_client_read_exact(connection, ids.get(),
+                                     static_cast<size_t>(count) * sizeof(int32_t));
     if (result != SDS_ERROR_NONE) return result;
   }
   out->ids = std::move(ids);

@@ -98,7 +98,8 @@ int sds_tool_show(SdsConnection& connection, int argc, char** argv) {
   std::printf("title:             %s\n", text(item.title));
   std::printf("dominant colour:   %s\n", text(item.dominant_color));
   std::printf("icon size:         %s\n", text(item.icon_size));
-  std::printf("touch icon exists: %s\n", flag(item.touch_icon_status, item.touch_icon_exists).c_str());
+  std::printf("touch icon exists: %s\n",
+              flag(item.touch_icon_status, item.touch_icon_exists).c_str());
   std::printf("favicon exists:    %s\n", flag(item.favicon_status, item.favicon_exists).c_str());
   // The pixels are asked for on their own: an icon the service can't hand
   // over is a fact about the item, not a failure of `show`.

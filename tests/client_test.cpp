@@ -162,8 +162,8 @@ TEST_F(ClientTest, InitializeSendsPositionThenVersionAndWaitsOutTheResult) {
   EXPECT_TRUE(connection_.is_open());
   const double position[2] = {37.5, 127.25};
   EXPECT_EQ(received(), words(SDS_CMD_INITIALIZE, kClientId, 0) +
-                            std::string(reinterpret_cast<const char*>(position), 16) +
-                            words(0, 5) + "1.2.3");
+                            std::string(reinterpret_cast<const char*>(position), 16) + words(0, 5) +
+                            "1.2.3");
 }
 
 TEST_F(ClientTest, InitializeWithoutVersionSendsFlagSixAndNoString) {
@@ -206,8 +206,7 @@ TEST_F(ClientTest, InitializeThatGivesUpWaitingClosesTheConnection) {
   });
   Ticks ticks;
   ticks.keep_waiting = false;
-  EXPECT_EQ(sds_client_initialize(connection_, 1, 2, nullptr, tick, &ticks, 1),
-            SDS_ERROR_IO_EINTR);
+  EXPECT_EQ(sds_client_initialize(connection_, 1, 2, nullptr, tick, &ticks, 1), SDS_ERROR_IO_EINTR);
   EXPECT_EQ(ticks.count, 1);
   EXPECT_FALSE(connection_.is_open());
   EXPECT_EQ(service_->finish().size(), 12u + 16u + 4u);

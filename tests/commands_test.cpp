@@ -38,16 +38,27 @@ constexpr int kBigHeight = 769;
 
 const std::string kLongUrl = "https://four.example/" + std::string(5000 - 21, 'u');
 
+// Live items 2, 1, 5 in deck order; 3 withdrawn by the server; 4 with
+// is_dirty 0 and a URL the wire can't carry.
 std::vector<SeedItem> base_deck() {
-  std::vector<SeedItem> items(5);
-  items[0] = {1, "https://one.example/", "One", "#102030", "3x2", 1, 0, 1, 2,
-              seed_pixels(kIconWidth, kIconHeight, 1)};
-  items[1] = {2, "https://two.example/news", "Two", "#405060", std::nullopt, 0, 1, 1, 1, {}};
-  items[2] = {3, "https://three.example/", "Three", std::nullopt, std::nullopt, 1, 1, -1, 3, {}};
-  items[3] = {4, kLongUrl, "Four", std::nullopt, std::nullopt, 0, 0, 0, 4, {}};
-  items[4] = {5,  "https://big.example/", "Big", std::nullopt, "1024x769", 0, 0, 1, 5,
-              seed_pixels(kBigWidth, kBigHeight, 5)};
-  return items;
+  SeedItem one = seed_item(1, "https://one.example/", "One", 2);
+  one.dominant_color = "#102030";
+  one.icon_size = "3x2";
+  one.touch_icon_exists = 1;
+  one.icon_data = seed_pixels(kIconWidth, kIconHeight, 1);
+  SeedItem two = seed_item(2, "https://two.example/news", "Two", 1);
+  two.dominant_color = "#405060";
+  two.favicon_exists = 1;
+  SeedItem three = seed_item(3, "https://three.example/", "Three", 3);
+  three.touch_icon_exists = 1;
+  three.favicon_exists = 1;
+  three.is_dirty = -1;
+  SeedItem four = seed_item(4, kLongUrl, "Four", 4);
+  four.is_dirty = 0;
+  SeedItem big = seed_item(5, "https://big.example/", "Big", 5);
+  big.icon_size = "1024x769";
+  big.icon_data = seed_pixels(kBigWidth, kBigHeight, 5);
+  return {one, two, three, four, big};
 }
 
 // Reads exactly `length` bytes within the bound; false when the stream ended
@@ -193,8 +204,8 @@ TEST_F(DeckCommands, FlagReplyIsStatusAndOneWordOnTheWire) {
 TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
   const auto pixels = seed_pixels(kIconWidth, kIconHeight, 1);
   send_header(SDS_CMD_GET_ICON, 1);
-  EXPECT_EQ(read_words(fd_, 4),
-            (std::vector<int32_t>{0, static_cast<int32_t>(pixels.size()), kIconWidth, kIconHeight}));
+  EXPECT_EQ(read_words(fd_, 4), (std::vector<int32_t>{0, static_cast<int32_t>(pixels.size()),
+                                                      kIconWidth, kIconHeight}));
   EXPECT_EQ(shm_prefix(pixels.size()), pixels);
 
   sds_client_icon icon;
@@ -260,10 +271,8 @@ TEST_F(DeckCommands, NextUpdateDurationFollowsTheFile) {
     int32_t seconds;
     bool warned;
   } cases[] = {
-      {"no file", nullptr, 86400, false},
-      {"empty file", "", 86400, false},
-      {"zero", "0", 86400, true},
-      {"negative", "-5", 86400, true},
+      {"no file", nullptr, 86400, false}, {"empty file", "", 86400, false},
+      {"zero", "0", 86400, true},         {"negative", "-5", 86400, true},
       {"an hour", "3600", 3600, false},
   };
   for (const auto& c : cases) {

@@ -21,13 +21,21 @@ namespace {
 class SitedeckTool : public ::testing::Test {
  protected:
   void SetUp() override {
-    std::vector<SeedItem> items(4);
-    items[0] = {7, "https://news.example/", "News", "#AA0000", "4x3", 1, 1, 1, 1,
-                seed_pixels(4, 3, 7)};
-    items[1] = {3, "https://mail.example/inbox", "Mail", std::nullopt, std::nullopt, 0, 0, 1, 2, {}};
-    items[2] = {9, "https://gone.example/", "Gone", "#000000", std::nullopt, 1, 0, -1, 3, {}};
-    items[3] = {5, "https://five.example/", "A very long title that will not fit the column",
-                "#00FF00", std::nullopt, 0, 1, 1, 4, {}};
+    SeedItem news = seed_item(7, "https://news.example/", "News", 1);
+    news.dominant_color = "#AA0000";
+    news.icon_size = "4x3";
+    news.touch_icon_exists = 1;
+    news.favicon_exists = 1;
+    news.icon_data = seed_pixels(4, 3, 7);
+    SeedItem mail = seed_item(3, "https://mail.example/inbox", "Mail", 2);
+    SeedItem gone = seed_item(9, "https://gone.example/", "Gone", 3);
+    gone.dominant_color = "#000000";
+    gone.is_dirty = -1;
+    SeedItem long_title =
+        seed_item(5, "https://five.example/", "A very long title that will not fit the column", 4);
+    long_title.dominant_color = "#00FF00";
+    long_title.favicon_exists = 1;
+    const std::vector<SeedItem> items = {news, mail, gone, long_title};
     ASSERT_TRUE(seed_deck(items));
     ASSERT_TRUE(service_.start_activated(/*once=*/false));
   }
@@ -47,13 +55,14 @@ TEST_F(SitedeckTool, ListPrintsTheLiveItemsInDeckOrder) {
   ProcessResult result = sitedeck({"list"});
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 0) << result.err;
-  EXPECT_EQ(result.out,
-            "ID  TITLE                             URL                         COLOUR   ICON  FLAGS\n"
-            "7   News                              https://news.example/       #AA0000  4x3   "
-            "touch,favicon\n"
-            "3   Mail                              https://mail.example/inbox  -        -     -\n"
-            "5   A very long title that will n...  https://five.example/       #00FF00  -     "
-            "favicon\n");
+  EXPECT_EQ(
+      result.out,
+      "ID  TITLE                             URL                         COLOUR   ICON  FLAGS\n"
+      "7   News                              https://news.example/       #AA0000  4x3   "
+      "touch,favicon\n"
+      "3   Mail                              https://mail.example/inbox  -        -     -\n"
+      "5   A very long title that will n...  https://five.example/       #00FF00  -     "
+      "favicon\n");
   EXPECT_EQ(result.err, "");
 }
 
@@ -139,14 +148,15 @@ TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
   ASSERT_TRUE(kdb_write("db/browser/sitedeck/geocoder_url", geocoder.root_url().c_str()));
   ASSERT_TRUE(write_file(root.path(SDS_SERVER_DATA_XML),
                          "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<values><Server><Id>1</Id>"
-                         "<Base-url>" + content.base_url() +
-                             "</Base-url><WaitTime>0</WaitTime><RetryCount>1</RetryCount>"
+                         "<Base-url>" +
+                             content.base_url() + "</Base-url>" +
+                             "<WaitTime>0</WaitTime><RetryCount>1</RetryCount>"
                              "<FallBack>false</FallBack></Server></values>\n"));
   ServiceHarness service;
   ASSERT_TRUE(service.start_activated(/*once=*/false));
   const std::string tool = std::string(SITEDECK_BIN_DIR) + "/sitedeck";
   const std::string socket = service.socket_path();
-  const std::vector<std::string> init = {tool,    "--socket", socket, "init",     "--lat",
+  const std::vector<std::string> init = {tool,   "--socket", socket, "init",      "--lat",
                                          "37.5", "--lon",    "127",  "--version", "9.0"};
 
   ProcessResult result = run_process(init);

@@ -46,6 +46,15 @@ bool insert(sqlite3* db, const SeedItem& item) {
 
 }  // namespace
 
+SeedItem seed_item(int id, const std::string& url, const std::string& title, int order_index) {
+  SeedItem item;
+  item.id = id;
+  item.url = url;
+  item.title = title;
+  item.order_index = order_index;
+  return item;
+}
+
 bool seed_deck(const std::vector<SeedItem>& items) {
   sqlite3* db = nullptr;
   if (sds_db_open(&db) != 0 || db == nullptr) return false;

@@ -20,6 +20,9 @@ struct SeedItem {
   std::vector<uint8_t> icon_data;
 };
 
+// A live item with the given texts and position, everything else default.
+SeedItem seed_item(int id, const std::string& url, const std::string& title, int order_index);
+
 // Creates the database if needed and inserts `items`; false with nothing
 // committed when any step fails.
 bool seed_deck(const std::vector<SeedItem>& items);
