@@ -87,6 +87,7 @@ int sds_client_connect(const std::string& socket_path, SdsConnection* out, int r
   if (sds_ipc_read_blob(fd.get(), &cid, sizeof cid) != 0) return SDS_ERROR_IO_ERROR;
   out->fd_ = std::move(fd);
   out->cid_ = cid;
+  out->shm_view_.reset();
   return SDS_ERROR_NONE;
 }
 

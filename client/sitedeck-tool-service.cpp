@@ -107,8 +107,9 @@ int sds_tool_init(SdsConnection& connection, int argc, char** argv) {
   double latitude = 0, longitude = 0;
   bool have_latitude = false, have_longitude = false;
   const char* version = nullptr;
-  for (int i = 0; i < argc; ++i) {
-    if (i + 1 >= argc) return kSdsToolUsage;
+  // Options come in pairs: name, value.
+  if (argc % 2 != 0) return kSdsToolUsage;
+  for (int i = 0; i < argc; i += 2) {
     const char* value = argv[i + 1];
     if (std::strcmp(argv[i], "--lat") == 0 && sds_tool_parse_double(value, &latitude)) {
       have_latitude = true;
@@ -119,7 +120,6 @@ int sds_tool_init(SdsConnection& connection, int argc, char** argv) {
     } else {
       return kSdsToolUsage;
     }
-    ++i;
   }
   if (!have_latitude || !have_longitude) return kSdsToolUsage;
 

@@ -217,6 +217,33 @@ TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
   EXPECT_EQ(std::vector<uint8_t>(icon.pixels.get(), icon.pixels.get() + icon.byte_count), pixels);
 }
 
+// The client keeps its mapping between icons. When another party removes the
+// object and a new one takes its name, the service writes into the new one:
+// reading the kept mapping would hand out whatever the old object held.
+TEST_F(DeckCommands, IconIsReadFromTheObjectNowBehindTheName) {
+  const auto pixels = seed_pixels(kIconWidth, kIconHeight, 1);
+  sds_client_icon first;
+  ASSERT_EQ(sds_client_get_icon(connection_, 1, &first), SDS_ERROR_NONE);
+
+  int old_fd = shm_open(SDS_SHM_NAME, O_RDWR, 0);
+  ASSERT_GE(old_fd, 0);
+  void* old_mapping = mmap(nullptr, SDS_SHM_SIZE, PROT_WRITE, MAP_SHARED, old_fd, 0);
+  (void)close(old_fd);
+  ASSERT_NE(old_mapping, MAP_FAILED);
+  std::memset(old_mapping, 0xEE, pixels.size());
+  (void)munmap(old_mapping, SDS_SHM_SIZE);
+  ASSERT_EQ(shm_unlink(SDS_SHM_NAME), 0);
+  int new_fd = shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT | O_EXCL, 0666);
+  ASSERT_GE(new_fd, 0);
+  EXPECT_EQ(ftruncate(new_fd, static_cast<off_t>(SDS_SHM_SIZE)), 0);
+  (void)close(new_fd);
+
+  sds_client_icon second;
+  ASSERT_EQ(sds_client_get_icon(connection_, 1, &second), SDS_ERROR_NONE);
+  EXPECT_EQ(std::vector<uint8_t>(second.pixels.get(), second.pixels.get() + second.byte_count),
+            pixels);
+}
+
 TEST_F(DeckCommands, IconOfAnItemWithoutPixelsIsStatusSixAlone) {
   send_header(SDS_CMD_GET_ICON, 2);
   EXPECT_EQ(read_words(fd_, 1), std::vector<int32_t>{SDS_ERROR_NO_DATA});
