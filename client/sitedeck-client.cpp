@@ -2,6 +2,7 @@
 // wire primitives of the service itself so that both ends agree on the bytes.
 #include "sitedeck-client.h"
 
+#include <sys/mman.h>
 #include <sys/socket.h>
 #include <sys/time.h>
 #include <sys/un.h>
@@ -31,6 +32,30 @@ int __sds_client_connect_socket(int fd, const struct sockaddr_un& address) {
 }
 
 }  // namespace
+
+SdsShmView& SdsShmView::operator=(SdsShmView&& other) noexcept {
+  if (this != &other) {
+    reset();
+    address_ = std::exchange(other.address_, nullptr);
+    size_ = std::exchange(other.size_, 0);
+    inode_ = std::exchange(other.inode_, 0);
+  }
+  return *this;
+}
+
+void SdsShmView::adopt(const unsigned char* address, size_t size, ino_t inode) {
+  reset();
+  address_ = address;
+  size_ = size;
+  inode_ = inode;
+}
+
+void SdsShmView::reset() {
+  if (address_ != nullptr) (void)munmap(const_cast<unsigned char*>(address_), size_);
+  address_ = nullptr;
+  size_ = 0;
+  inode_ = 0;
+}
 
 int sds_client_connect(const std::string& socket_path, SdsConnection* out, int read_timeout_ms) {
   if (out == nullptr || read_timeout_ms < 0) return SDS_ERROR_INVALID_PARAMETER;
@@ -62,6 +87,7 @@ int sds_client_connect(const std::string& socket_path, SdsConnection* out, int r
   if (sds_ipc_read_blob(fd.get(), &cid, sizeof cid) != 0) return SDS_ERROR_IO_ERROR;
   out->fd_ = std::move(fd);
   out->cid_ = cid;
+  out->shm_view_.reset();
   return SDS_ERROR_NONE;
 }
 
@@ -85,10 +111,18 @@ int sds_client_send_header(const SdsConnection& connection, int32_t cmd, int32_t
 }
 
 int sds_client_read_status(const SdsConnection& connection) {
-  return sds_ipc_read_errorcode(connection.fd());
+  if (!connection.is_open()) return SDS_ERROR_IO_ERROR;
+  // The whole word: a status split over two reads must not be taken for a
+  // small number.
+  int32_t status = 0;
+  if (sds_ipc_read_blob(connection.fd(), &status, sizeof status) != 0) return SDS_ERROR_IO_ERROR;
+  return status;
 }
 
 int sds_client_request(const SdsConnection& connection, int32_t cmd, int32_t item_id) {
-  sds_command header = sds_client_header(connection, cmd, item_id);
-  return sds_ipc_simple_response(connection.fd(), &header);
+  if (cmd == 0) return SDS_ERROR_INVALID_PARAMETER;
+  if (!connection.is_open()) return SDS_ERROR_IO_ERROR;
+  int result = sds_client_send_header(connection, cmd, item_id);
+  if (result != SDS_ERROR_NONE) return result;
+  return sds_client_read_status(connection);
 }

@@ -1,18 +1,47 @@
 // The client end of the site-deck service's socket protocol (docs/protocol.md)
 // for programs that want the deck: connect and handshake, then one call per
-// request. Every call returns an SDS code, the same numbers the service sends
-// as statuses, and never throws. A connection serves one client at a time:
-// the protocol is strictly request, then reply.
+// request (sitedeck-client-commands.h). Every call returns an SDS code, the
+// same numbers the service sends as statuses, and never throws. A connection
+// serves one client at a time: the protocol is strictly request, then reply.
 #pragma once
+
+#include <sys/types.h>
 
 #include <cstdint>
 #include <string>
+#include <utility>
 
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-types.h"
 
+// The read-only view of the service's shared-memory object that a connection
+// keeps between icon requests, so that an icon costs no open and map of its
+// own. `inode` tells whether the name still leads to the mapped object.
+class SdsShmView {
+ public:
+  SdsShmView() = default;
+  SdsShmView(const SdsShmView&) = delete;
+  SdsShmView& operator=(const SdsShmView&) = delete;
+  SdsShmView(SdsShmView&& other) noexcept { *this = std::move(other); }
+  SdsShmView& operator=(SdsShmView&& other) noexcept;
+  ~SdsShmView() { reset(); }
+
+  const unsigned char* data() const { return address_; }
+  size_t size() const { return size_; }
+  ino_t inode() const { return inode_; }
+  // Takes over a mapping of `size` bytes of the object with `inode`.
+  void adopt(const unsigned char* address, size_t size, ino_t inode);
+  void reset();
+
+ private:
+  const unsigned char* address_ = nullptr;
+  size_t size_ = 0;
+  ino_t inode_ = 0;
+};
+
 // One connection as the handshake set it up: the socket and the client id the
-// service issued. Move-only; closing it ends the service process behind it.
+// service issued, plus the shared-memory view of its icon requests.
+// Move-only; closing it ends the service process behind it.
 class SdsConnection {
  public:
   SdsConnection() = default;
@@ -20,9 +49,12 @@ class SdsConnection {
   int fd() const { return fd_.get(); }
   int32_t cid() const { return cid_; }
   bool is_open() const { return static_cast<bool>(fd_); }
+  // The icon calls keep their mapping here; it goes with the connection.
+  SdsShmView& shm_view() { return shm_view_; }
   void close() {
     fd_.reset();
     cid_ = 0;
+    shm_view_.reset();
   }
 
  private:
@@ -30,6 +62,7 @@ class SdsConnection {
                                 int read_timeout_ms);
   UniqueFd fd_;
   int32_t cid_ = 0;
+  SdsShmView shm_view_;
 };
 
 // Connects to the service's socket and reads the handshake {status 0, client
@@ -52,8 +85,9 @@ sds_command sds_client_header(const SdsConnection& connection, int32_t cmd, int3
 // Sends the header of a request; SDS_ERROR_NONE or SDS_ERROR_IO_ERROR.
 int sds_client_send_header(const SdsConnection& connection, int32_t cmd, int32_t item_id);
 
-// Reads the status that opens every reply. A connection that ended or failed
-// gives SDS_ERROR_IO_ERROR, which a status of 1 cannot be told apart from.
+// Reads the status that opens every reply, all four bytes of it. A connection
+// that ended, failed or timed out gives SDS_ERROR_IO_ERROR, which a status of
+// 1 cannot be told apart from.
 int sds_client_read_status(const SdsConnection& connection);
 
 // Sends the header and reads the reply's status: the first step of every

@@ -1,0 +1,189 @@
+#include "bench.h"
+
+#include <algorithm>
+#include <chrono>
+#include <cmath>
+#include <cstdio>
+#include <ctime>
+
+namespace {
+
+// Tries of one iteration before its case counts as failed.
+constexpr int kTriesPerIteration = 3;
+
+// `value` with `decimals` digits after the point.
+std::string fixed(double value, int decimals) {
+  char buffer[64];
+  std::snprintf(buffer, sizeof buffer, "%.*f", decimals, value);
+  return buffer;
+}
+
+std::string micros(int64_t ns) { return fixed(static_cast<double>(ns) / 1000.0, 1); }
+
+std::string json_escape(const std::string& text) {
+  std::string out;
+  for (char c : text) {
+    if (c == '"' || c == '\\') out += '\\';
+    if (static_cast<unsigned char>(c) < 0x20) continue;
+    out += c;
+  }
+  return out;
+}
+
+// Runs one iteration, recovering and repeating it after a failure when the
+// case can; `elapsed_ns` gets the time of the try that succeeded.
+bool run_once(const bench_case& c, bench_result* result, int64_t* elapsed_ns) {
+  for (int attempt = 1; attempt <= kTriesPerIteration; ++attempt) {
+    auto start = std::chrono::steady_clock::now();
+    bool ok = c.body();
+    auto end = std::chrono::steady_clock::now();
+    if (ok) {
+      if (elapsed_ns != nullptr) {
+        *elapsed_ns = std::chrono::duration_cast<std::chrono::nanoseconds>(end - start).count();
+      }
+      return true;
+    }
+    if (!c.recover || attempt == kTriesPerIteration || !c.recover()) return false;
+    ++result->repeated;
+  }
+  return false;
+}
+
+}  // namespace
+
+std::vector<bench_result> bench_time_cases(const std::string& group,
+                                           const std::vector<bench_case>& cases, int iterations,
+                                           int warmup, int block) {
+  std::vector<bench_result> results(cases.size());
+  for (size_t c = 0; c < cases.size(); ++c) {
+    results[c].group = group;
+    results[c].name = cases[c].name;
+    results[c].description = cases[c].description;
+    results[c].floor = cases[c].floor;
+    results[c].samples_ns.reserve(static_cast<size_t>(iterations));
+    for (int i = 0; i < warmup && !results[c].failed; ++i) {
+      if (!run_once(cases[c], &results[c], nullptr)) {
+        results[c].failed = true;
+        results[c].failure = "failed during warm-up";
+      }
+    }
+  }
+  if (block < 1) block = 1;
+  for (int done = 0; done < iterations; done += block) {
+    int count = std::min(block, iterations - done);
+    for (size_t c = 0; c < cases.size(); ++c) {
+      bench_result& result = results[c];
+      for (int i = 0; i < count && !result.failed; ++i) {
+        int64_t elapsed_ns = 0;
+        if (!run_once(cases[c], &result, &elapsed_ns)) {
+          result.failed = true;
+          result.failure = "failed at iteration " + std::to_string(done + i);
+          break;
+        }
+        result.samples_ns.push_back(elapsed_ns);
+      }
+    }
+  }
+  return results;
+}
+
+int64_t bench_quantile(const std::vector<int64_t>& samples_ns, double q) {
+  if (samples_ns.empty()) return 0;
+  std::vector<int64_t> sorted = samples_ns;
+  std::sort(sorted.begin(), sorted.end());
+  auto rank = static_cast<size_t>(std::ceil(q * static_cast<double>(sorted.size())));
+  return sorted[std::clamp<size_t>(rank, 1, sorted.size()) - 1];
+}
+
+void bench_report::add(bench_result result) {
+  if (result.failed) {
+    std::fprintf(stderr, "bench: %s/%s: %s\n", result.group.c_str(), result.name.c_str(),
+                 result.failure.c_str());
+  }
+  results_.push_back(std::move(result));
+}
+
+int bench_report::iterations(const bench_options& options, int full, int quick) {
+  return options.quick ? quick : full;
+}
+
+const bench_result* bench_report::find(const std::string& name) const {
+  for (const auto& r : results_) {
+    if (r.name == name && !r.failed) return &r;
+  }
+  return nullptr;
+}
+
+bool bench_report::any_failed() const {
+  return std::any_of(results_.begin(), results_.end(), [](const auto& r) { return r.failed; });
+}
+
+std::string bench_report::markdown() const {
+  std::string out =
+      "| scenario | iterations | median µs | p99 µs | floor | ratio median | ratio p99 |\n"
+      "|---|---:|---:|---:|---|---:|---:|\n";
+  for (const auto& r : results_) {
+    std::string name = r.group + "/" + r.name;
+    if (r.failed) {
+      out += "| " + name + " | failed: " + r.failure + " | | | | | |\n";
+      continue;
+    }
+    int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
+    std::string floor_cell = "—", ratio_median = "—", ratio_p99 = "—";
+    if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
+      int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
+      int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
+      floor_cell = f->name;
+      if (floor_median > 0) {
+        ratio_median = fixed(static_cast<double>(median) / floor_median, 2);
+      }
+      if (floor_p99 > 0) ratio_p99 = fixed(static_cast<double>(p99) / floor_p99, 2);
+    }
+    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " + micros(median) +
+           " | " + micros(p99) + " | " + floor_cell + " | " + ratio_median + " | " + ratio_p99 +
+           " |\n";
+  }
+  for (const auto& r : results_) {
+    if (r.repeated > 0) {
+      out += "\n" + r.group + "/" + r.name + ": " + std::to_string(r.repeated) +
+             " iteration(s) repeated after a recovery (another process disturbed the run)\n";
+    }
+  }
+  return out;
+}
+
+std::string bench_report::json(const std::string& mode) const {
+  char when[32] = {};
+  std::time_t now = std::time(nullptr);
+  (void)std::strftime(when, sizeof when, "%Y-%m-%dT%H:%M:%SZ", std::gmtime(&now));
+  std::string out = "{\n  \"time\": \"" + std::string(when) + "\",\n  \"mode\": \"" + mode +
+                    "\",\n  \"scenarios\": [";
+  bool first = true;
+  for (const auto& r : results_) {
+    out += first ? "\n" : ",\n";
+    first = false;
+    out += "    {\"group\": \"" + json_escape(r.group) + "\", \"name\": \"" + json_escape(r.name) +
+           "\", \"description\": \"" + json_escape(r.description) + "\"";
+    if (r.failed) {
+      out += ", \"failed\": \"" + json_escape(r.failure) + "\"}";
+      continue;
+    }
+    int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
+    out += ", \"iterations\": " + std::to_string(r.samples_ns.size()) +
+           ", \"median_ns\": " + std::to_string(median) + ", \"p99_ns\": " + std::to_string(p99) +
+           ", \"min_ns\": " + std::to_string(bench_quantile(r.samples_ns, 0.0)) +
+           ", \"repeated\": " + std::to_string(r.repeated);
+    if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
+      int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
+      int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
+      out += ", \"floor\": \"" + json_escape(f->name) + "\"";
+      if (floor_median > 0 && floor_p99 > 0) {
+        out += ", \"ratio_median\": " + fixed(static_cast<double>(median) / floor_median, 3) +
+               ", \"ratio_p99\": " + fixed(static_cast<double>(p99) / floor_p99, 3);
+      }
+    }
+    out += "}";
+  }
+  out += "\n  ]\n}\n";
+  return out;
+}

@@ -1,0 +1,140 @@
+// The `sitedeck` subcommands about the service itself rather than one item:
+// `hello`, `next-update`, `release` and `init` (a data pull, with a spinner
+// on a terminal while it runs), and the argument and status helpers.
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cmath>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "sitedeck-client-commands.h"
+#include "sitedeck-service-ipc.h"
+#include "sitedeck-tool.h"
+
+namespace {
+
+// What a pull's result means to the person who asked for it. sds_error_string
+// names several of these "SDS_ERROR_UNKNOWN", a text peers rely on.
+const char* __pull_meaning(int status) {
+  switch (status) {
+    case SDS_ERROR_NONE:
+      return "a new item list was stored";
+    case SDS_ERROR_HTTP_NOT_MODIFIED:
+      return "the stored item list is current";
+    case SDS_ERROR_SERVER_REQUEST_FAILED:
+      return "the server requests failed";
+    case SDS_ERROR_HTTP_MOVED_PERMANENTLY:
+      return "the server moved and could not be reached";
+    case SDS_ERROR_DATA_PULL_FAILED:
+      return "no pull possible (no server list or request URL)";
+    case SDS_ERROR_DB_OPEN_FAILED:
+      return "the database could not be opened";
+    default:
+      return "the pull failed";
+  }
+}
+
+struct sds_tool_spinner {
+  std::chrono::steady_clock::time_point start = std::chrono::steady_clock::now();
+  unsigned frame = 0;
+};
+
+bool __spin(void* user) {
+  static constexpr char kFrames[] = "|/-\\";
+  auto* spinner = static_cast<sds_tool_spinner*>(user);
+  double seconds =
+      std::chrono::duration<double>(std::chrono::steady_clock::now() - spinner->start).count();
+  std::fprintf(stderr, "\r%c pulling the item list... %.1f s", kFrames[spinner->frame++ % 4],
+               seconds);
+  std::fflush(stderr);
+  return true;
+}
+
+}  // namespace
+
+bool sds_tool_parse_id(const char* text, int32_t* id) {
+  if (text == nullptr || *text < '0' || *text > '9') return false;
+  errno = 0;
+  char* end = nullptr;
+  long value = std::strtol(text, &end, 10);
+  if (errno != 0 || *end != '\0' || value > INT32_MAX) return false;
+  *id = static_cast<int32_t>(value);
+  return true;
+}
+
+bool sds_tool_parse_double(const char* text, double* value) {
+  if (text == nullptr || *text == '\0') return false;
+  errno = 0;
+  char* end = nullptr;
+  double parsed = std::strtod(text, &end);
+  if (errno != 0 || *end != '\0' || !std::isfinite(parsed)) return false;
+  *value = parsed;
+  return true;
+}
+
+void sds_tool_print_status(FILE* out, int status) {
+  std::fprintf(out, "%s (%d)", sds_error_string(status), status);
+}
+
+int sds_tool_hello(SdsConnection& connection, int argc, char** /*argv*/) {
+  if (argc != 0) return kSdsToolUsage;
+  std::printf("client id: %d\n", connection.cid());
+  return SDS_ERROR_NONE;
+}
+
+int sds_tool_next_update(SdsConnection& connection, int argc, char** /*argv*/) {
+  if (argc != 0) return kSdsToolUsage;
+  int32_t seconds = 0;
+  int status = sds_client_get_next_update_duration(connection, &seconds);
+  if (status != SDS_ERROR_NONE) return status;
+  std::printf("%d\n", seconds);
+  return SDS_ERROR_NONE;
+}
+
+int sds_tool_release(SdsConnection& connection, int argc, char** /*argv*/) {
+  if (argc != 0) return kSdsToolUsage;
+  int status = sds_client_release_shm(connection);
+  if (status != SDS_ERROR_NONE) return status;
+  std::printf("shared memory released\n");
+  return SDS_ERROR_NONE;
+}
+
+int sds_tool_init(SdsConnection& connection, int argc, char** argv) {
+  double latitude = 0, longitude = 0;
+  bool have_latitude = false, have_longitude = false;
+  const char* version = nullptr;
+  // Options come in pairs: name, value.
+  if (argc % 2 != 0) return kSdsToolUsage;
+  for (int i = 0; i < argc; i += 2) {
+    const char* value = argv[i + 1];
+    if (std::strcmp(argv[i], "--lat") == 0 && sds_tool_parse_double(value, &latitude)) {
+      have_latitude = true;
+    } else if (std::strcmp(argv[i], "--lon") == 0 && sds_tool_parse_double(value, &longitude)) {
+      have_longitude = true;
+    } else if (std::strcmp(argv[i], "--version") == 0) {
+      version = value;
+    } else {
+      return kSdsToolUsage;
+    }
+  }
+  if (!have_latitude || !have_longitude) return kSdsToolUsage;
+
+  sds_tool_spinner spinner;
+  bool animate = isatty(STDERR_FILENO) == 1;
+  int status = sds_client_initialize(connection, latitude, longitude, version,
+                                     animate ? __spin : nullptr, &spinner);
+  if (animate) std::fprintf(stderr, "\r\033[K");
+  // Status 1 is what a connection lost during the pull looks like, not a
+  // result the service sent.
+  if (status == SDS_ERROR_IO_ERROR || status == SDS_ERROR_IO_EINTR) return status;
+  std::printf("pull result: ");
+  sds_tool_print_status(stdout, status);
+  std::printf(": %s\n", __pull_meaning(status));
+  // Both outcomes leave a current deck behind.
+  if (status == SDS_ERROR_NONE || status == SDS_ERROR_HTTP_NOT_MODIFIED) return SDS_ERROR_NONE;
+  return kSdsToolReported;
+}

@@ -1,0 +1,37 @@
+// Pieces of the `sitedeck` command line shared between its files: the shape of
+// a subcommand and the helpers for parsing arguments and reporting statuses.
+#pragma once
+
+#include <cstdint>
+#include <cstdio>
+
+#include "sitedeck-client.h"
+
+// Results of a subcommand besides SDS codes (which are all 0 or above).
+constexpr int kSdsToolUsage = -1;     // bad arguments: print the usage, exit 2
+constexpr int kSdsToolReported = -2;  // failure already told to the user: exit 1
+
+// A subcommand gets the open connection and its own arguments (argv[0] is the
+// first argument after its name). It returns SDS_ERROR_NONE, another SDS code
+// for the driver to report, or one of the kSdsTool* results.
+struct sds_tool_command {
+  const char* name;
+  const char* arguments;
+  const char* help;
+  int (*run)(SdsConnection& connection, int argc, char** argv);
+};
+
+int sds_tool_hello(SdsConnection& connection, int argc, char** argv);
+int sds_tool_list(SdsConnection& connection, int argc, char** argv);
+int sds_tool_show(SdsConnection& connection, int argc, char** argv);
+int sds_tool_icon(SdsConnection& connection, int argc, char** argv);
+int sds_tool_next_update(SdsConnection& connection, int argc, char** argv);
+int sds_tool_release(SdsConnection& connection, int argc, char** argv);
+int sds_tool_init(SdsConnection& connection, int argc, char** argv);
+
+// Parses a whole decimal item id (0 to INT32_MAX); false for anything else.
+bool sds_tool_parse_id(const char* text, int32_t* id);
+// Parses a whole decimal number (a coordinate); false for anything else.
+bool sds_tool_parse_double(const char* text, double* value);
+// "NAME (N)" for an SDS code, NAME being sds_error_string's text.
+void sds_tool_print_status(FILE* out, int status);

@@ -1,0 +1,346 @@
+// The client library against a scripted peer on a real Unix socket: the bytes
+// each call sends, how it treats replies a real service would not give (an
+// icon beyond the shared memory, an id count beyond reason, a reply cut
+// short), and the long wait of initialize.
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstring>
+#include <functional>
+#include <memory>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "sitedeck-client-commands.h"
+#include "sitedeck-service-paths.h"
+#include "support/socket_pair.h"
+#include "support/temp_root.h"
+
+namespace {
+
+constexpr int kBoundMs = 10000;
+constexpr int32_t kClientId = 77;
+
+// Reads exactly `length` bytes within the bound and appends them to `out`.
+bool read_into(int fd, size_t length, std::string* out) {
+  while (length > 0) {
+    struct pollfd entry = {fd, POLLIN, 0};
+    if (poll(&entry, 1, kBoundMs) != 1) return false;
+    char buffer[256];
+    ssize_t n = read(fd, buffer, std::min(length, sizeof buffer));
+    if (n <= 0) return false;
+    out->append(buffer, static_cast<size_t>(n));
+    length -= static_cast<size_t>(n);
+  }
+  return true;
+}
+
+// Everything the client sends until it closes (bounded).
+std::string read_until_end(int fd) {
+  std::string out;
+  for (;;) {
+    struct pollfd entry = {fd, POLLIN, 0};
+    if (poll(&entry, 1, kBoundMs) != 1) return out + "<no end>";
+    char buffer[256];
+    ssize_t n = read(fd, buffer, sizeof buffer);
+    if (n <= 0) return out;
+    out.append(buffer, static_cast<size_t>(n));
+  }
+}
+
+template <typename... Words>
+std::string words(Words... values) {
+  std::string out;
+  for (int32_t value : {static_cast<int32_t>(values)...}) {
+    out.append(reinterpret_cast<const char*>(&value), sizeof value);
+  }
+  return out;
+}
+
+// A stand-in service on the socket of the current root: accepts one client,
+// sends the handshake {0, kClientId} and runs `script` on the connection,
+// which records what it received in `received`.
+class ScriptedService {
+ public:
+  explicit ScriptedService(std::function<void(int fd, std::string* received)> script)
+      : path_(sds_path(SDS_SOCKET_PATH)) {
+    struct sockaddr_un address {};
+    address.sun_family = AF_UNIX;
+    (void)unlink(path_.c_str());
+    std::memcpy(address.sun_path, path_.c_str(), path_.size() + 1);
+    listening_.reset(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    if (bind(listening_.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+        listen(listening_.get(), 1) != 0) {
+      return;
+    }
+    thread_ = std::thread([this, script = std::move(script)] {
+      struct pollfd entry = {listening_.get(), POLLIN, 0};
+      if (poll(&entry, 1, kBoundMs) != 1) return;
+      UniqueFd client(accept4(listening_.get(), nullptr, nullptr, SOCK_CLOEXEC));
+      if (!client) return;
+      std::string handshake = words(0, kClientId);
+      if (!write_all(client.get(), handshake.data(), handshake.size())) return;
+      script(client.get(), &received_);
+    });
+  }
+  ~ScriptedService() { finish(); }
+
+  // Waits for the script to end; what it received is then stable.
+  const std::string& finish() {
+    if (thread_.joinable()) thread_.join();
+    return received_;
+  }
+  const std::string& path() const { return path_; }
+
+ private:
+  std::string path_;
+  UniqueFd listening_;
+  std::string received_;
+  std::thread thread_;
+};
+
+class ClientTest : public ::testing::Test {
+ protected:
+  // Starts `script` and connects to it.
+  void serve(std::function<void(int fd, std::string* received)> script) {
+    service_.reset();
+    service_ = std::make_unique<ScriptedService>(std::move(script));
+    ASSERT_EQ(sds_client_connect(service_->path(), &connection_, kBoundMs), SDS_ERROR_NONE);
+    ASSERT_EQ(connection_.cid(), kClientId);
+  }
+  // Closes the client's end and returns everything the script received.
+  std::string received() {
+    connection_.close();
+    return service_->finish();
+  }
+
+  TempRoot root_;
+  std::unique_ptr<ScriptedService> service_;
+  SdsConnection connection_;
+};
+
+struct Ticks {
+  int count = 0;
+  int release_after = 0;  // write a byte to `release_fd` at this tick
+  int release_fd = -1;
+  bool keep_waiting = true;
+};
+
+bool tick(void* user) {
+  auto* ticks = static_cast<Ticks*>(user);
+  if (++ticks->count == ticks->release_after) (void)write_int(ticks->release_fd, 1);
+  return ticks->keep_waiting;
+}
+
+TEST_F(ClientTest, InitializeSendsPositionThenVersionAndWaitsOutTheResult) {
+  int release[2];
+  ASSERT_EQ(pipe(release), 0);
+  UniqueFd release_read(release[0]), release_write(release[1]);
+  serve([&](int fd, std::string* got) {
+    if (!read_into(fd, 12, got)) return;
+    (void)write_int(fd, 0);
+    if (!read_into(fd, 16, got)) return;
+    (void)write_int(fd, 0);
+    if (!read_into(fd, 4 + 4 + 5, got)) return;
+    // The result comes only once the client has been told twice to wait.
+    std::string token;
+    if (!read_into(release_read.get(), 4, &token)) return;
+    (void)write_int(fd, SDS_ERROR_HTTP_NOT_MODIFIED);
+    got->append(read_until_end(fd));
+  });
+  Ticks ticks;
+  ticks.release_after = 2;
+  ticks.release_fd = release_write.get();
+  EXPECT_EQ(sds_client_initialize(connection_, 37.5, 127.25, "1.2.3", tick, &ticks, 1),
+            SDS_ERROR_HTTP_NOT_MODIFIED);
+  EXPECT_GE(ticks.count, 2);
+  EXPECT_TRUE(connection_.is_open());
+  const double position[2] = {37.5, 127.25};
+  EXPECT_EQ(received(), words(SDS_CMD_INITIALIZE, kClientId, 0) +
+                            std::string(reinterpret_cast<const char*>(position), 16) + words(0, 5) +
+                            "1.2.3");
+}
+
+TEST_F(ClientTest, InitializeWithoutVersionSendsFlagSixAndNoString) {
+  for (const char* version : {static_cast<const char*>(nullptr), ""}) {
+    serve([](int fd, std::string* got) {
+      if (!read_into(fd, 12, got)) return;
+      (void)write_int(fd, 0);
+      if (!read_into(fd, 16, got)) return;
+      (void)write_int(fd, 0);
+      if (!read_into(fd, 4, got)) return;
+      (void)write_int(fd, SDS_ERROR_NONE);
+      got->append(read_until_end(fd));
+    });
+    EXPECT_EQ(sds_client_initialize(connection_, -90, 180, version), SDS_ERROR_NONE);
+    const double position[2] = {-90, 180};
+    EXPECT_EQ(received(), words(SDS_CMD_INITIALIZE, kClientId, 0) +
+                              std::string(reinterpret_cast<const char*>(position), 16) +
+                              words(SDS_ERROR_NO_DATA));
+  }
+}
+
+TEST_F(ClientTest, InitializeStopsAtTheFirstStatusThatIsNotZero) {
+  serve([](int fd, std::string* got) {
+    if (!read_into(fd, 12, got)) return;
+    (void)write_int(fd, SDS_ERROR_DB_OPEN_FAILED);
+    got->append(read_until_end(fd));
+  });
+  EXPECT_EQ(sds_client_initialize(connection_, 1, 2, "9"), SDS_ERROR_DB_OPEN_FAILED);
+  EXPECT_EQ(received(), words(SDS_CMD_INITIALIZE, kClientId, 0));
+}
+
+TEST_F(ClientTest, InitializeThatGivesUpWaitingClosesTheConnection) {
+  serve([](int fd, std::string* got) {
+    if (!read_into(fd, 12, got)) return;
+    (void)write_int(fd, 0);
+    if (!read_into(fd, 16, got)) return;
+    (void)write_int(fd, 0);
+    if (!read_into(fd, 4, got)) return;
+    got->append(read_until_end(fd));  // never answers
+  });
+  Ticks ticks;
+  ticks.keep_waiting = false;
+  EXPECT_EQ(sds_client_initialize(connection_, 1, 2, nullptr, tick, &ticks, 1), SDS_ERROR_IO_EINTR);
+  EXPECT_EQ(ticks.count, 1);
+  EXPECT_FALSE(connection_.is_open());
+  EXPECT_EQ(service_->finish().size(), 12u + 16u + 4u);
+}
+
+TEST_F(ClientTest, InitializeRefusesAVersionTheWireCannotCarry) {
+  serve([](int fd, std::string* got) { got->append(read_until_end(fd)); });
+  EXPECT_EQ(sds_client_initialize(connection_, 1, 2, std::string(4097, 'v').c_str()),
+            SDS_ERROR_INVALID_PARAMETER);
+  EXPECT_EQ(received(), "");
+}
+
+TEST_F(ClientTest, IdRequestsCarryTheirConditionWords) {
+  serve([](int fd, std::string* got) {
+    if (!read_into(fd, 12 + 4, got)) return;
+    std::string reply = words(0, 2, 9, 4);
+    (void)write_all(fd, reply.data(), reply.size());
+    if (!read_into(fd, 12 + 4 + 2 + 4, got)) return;
+    (void)write_int(fd, SDS_ERROR_NO_DATA);
+    got->append(read_until_end(fd));
+  });
+  sds_client_ids ids;
+  ASSERT_EQ(sds_client_get_full_ids(connection_, &ids), SDS_ERROR_NONE);
+  EXPECT_EQ(std::vector<int32_t>(ids.ids.get(), ids.ids.get() + ids.count),
+            (std::vector<int32_t>{9, 4}));
+  sds_client_ids dirty;
+  EXPECT_EQ(sds_client_get_ids_by_dirty(connection_, -1, &dirty), SDS_ERROR_NO_DATA);
+  const uint16_t selector = SITE_DECK_ADAPTOR_O_DIRTY;
+  EXPECT_EQ(received(), words(SDS_CMD_GET_FULL_IDS, kClientId, 0, SDS_ERROR_NO_DATA) +
+                            words(SDS_CMD_GET_FULL_IDS, kClientId, 0, 0) +
+                            std::string(reinterpret_cast<const char*>(&selector), 2) + words(-1));
+}
+
+TEST_F(ClientTest, IdCountOutOfBoundsIsRefusedBeforeAnyAllocation) {
+  for (int32_t count : {SDS_CLIENT_MAX_IDS + 1, -1}) {
+    serve([count](int fd, std::string* got) {
+      if (!read_into(fd, 16, got)) return;
+      std::string reply = words(0, count);
+      (void)write_all(fd, reply.data(), reply.size());
+      got->append(read_until_end(fd));
+    });
+    sds_client_ids ids;
+    EXPECT_EQ(sds_client_get_full_ids(connection_, &ids), SDS_ERROR_INVALID_PARAMETER) << count;
+    EXPECT_FALSE(ids.ids) << count;
+    EXPECT_FALSE(connection_.is_open()) << count;  // the ids would follow
+    received();
+  }
+}
+
+TEST_F(ClientTest, IdRequestAnsweredWithFifteenClosesTheConnection) {
+  serve([](int fd, std::string* got) {
+    if (!read_into(fd, 16, got)) return;
+    (void)write_int(fd, SDS_ERROR_DB_OPEN_FAILED);
+    got->append(read_until_end(fd));
+  });
+  sds_client_ids ids;
+  EXPECT_EQ(sds_client_get_full_ids(connection_, &ids), SDS_ERROR_DB_OPEN_FAILED);
+  // The service left the flag unread; it would be taken for the next header.
+  EXPECT_FALSE(connection_.is_open());
+}
+
+TEST_F(ClientTest, IconRepliesThatDoNotDescribeAFittingImageAreRefused) {
+  struct Case {
+    const char* name;
+    int32_t byte_count, width, height;
+  } cases[] = {
+      {"larger than the shared memory", 1024 * 769 * 4, 1024, 769},
+      {"not four bytes per pixel", 27, 3, 3},
+      {"zero width", 0, 0, 5},
+      {"negative byte count", -16, -2, 2},
+  };
+  for (const auto& c : cases) {
+    serve([&c](int fd, std::string* got) {
+      if (!read_into(fd, 12, got)) return;
+      std::string reply = words(0, c.byte_count, c.width, c.height);
+      (void)write_all(fd, reply.data(), reply.size());
+      got->append(read_until_end(fd));
+    });
+    sds_client_icon icon;
+    EXPECT_EQ(sds_client_get_icon(connection_, 3, &icon), SDS_ERROR_INVALID_PARAMETER) << c.name;
+    EXPECT_FALSE(icon.pixels) << c.name;
+    EXPECT_EQ(icon.byte_count, 0) << c.name;
+    EXPECT_TRUE(connection_.is_open()) << c.name;  // the whole reply was read
+    EXPECT_EQ(received(), words(SDS_CMD_GET_ICON, kClientId, 3)) << c.name;
+  }
+}
+
+TEST_F(ClientTest, ReplyCutShortClosesTheConnection) {
+  serve([](int fd, std::string* got) {
+    if (!read_into(fd, 12, got)) return;
+    std::string reply = words(0, 10) + "abc";  // a ten-byte string, three sent
+    (void)write_all(fd, reply.data(), reply.size());
+  });
+  UniqueCStr title;
+  EXPECT_EQ(sds_client_get_title(connection_, 1, &title), SDS_ERROR_IO_ERROR);
+  EXPECT_FALSE(title);
+  EXPECT_FALSE(connection_.is_open());
+  int32_t seconds = 0;
+  EXPECT_EQ(sds_client_get_next_update_duration(connection_, &seconds), SDS_ERROR_IO_ERROR);
+}
+
+TEST_F(ClientTest, NegativeItemIdIsRefusedWithoutSending) {
+  serve([](int fd, std::string* got) {
+    if (!read_into(fd, 12, got)) return;
+    std::string reply = words(0, 600);
+    (void)write_all(fd, reply.data(), reply.size());
+    got->append(read_until_end(fd));
+  });
+  UniqueCStr url;
+  int32_t flag = 0;
+  sds_client_icon icon;
+  EXPECT_EQ(sds_client_get_url(connection_, -3, &url), SDS_ERROR_INVALID_PARAMETER);
+  EXPECT_EQ(sds_client_get_favicon_exists(connection_, -3, &flag), SDS_ERROR_INVALID_PARAMETER);
+  EXPECT_EQ(sds_client_get_icon(connection_, -3, &icon), SDS_ERROR_INVALID_PARAMETER);
+  int32_t seconds = 0;
+  EXPECT_EQ(sds_client_get_next_update_duration(connection_, &seconds), SDS_ERROR_NONE);
+  EXPECT_EQ(seconds, 600);
+  EXPECT_EQ(received(), words(SDS_CMD_GET_NEXT_UPDATE_DURATION, kClientId, 0));
+}
+
+TEST_F(ClientTest, ReleaseClosesTheConnectionOnlyWhenTheServiceEndsIt) {
+  serve([](int fd, std::string* got) {
+    if (!read_into(fd, 12, got)) return;
+    (void)write_int(fd, SDS_ERROR_SHM_FAILED);
+    if (!read_into(fd, 12, got)) return;
+    (void)write_int(fd, SDS_ERROR_NONE);
+    got->append(read_until_end(fd));
+  });
+  EXPECT_EQ(sds_client_release_shm(connection_), SDS_ERROR_SHM_FAILED);
+  EXPECT_TRUE(connection_.is_open());
+  EXPECT_EQ(sds_client_release_shm(connection_), SDS_ERROR_NONE);
+  EXPECT_FALSE(connection_.is_open());
+  EXPECT_EQ(service_->finish(),
+            words(SDS_CMD_FREE_SHM, kClientId, 0) + words(SDS_CMD_FREE_SHM, kClientId, 0));
+}
+
+}  // namespace

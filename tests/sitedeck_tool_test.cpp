@@ -1,0 +1,175 @@
+// The `sitedeck` command line against the real service under the activator,
+// with a seeded database: the table of `list`, the fields of `show`, the PNG
+// that `icon -o` writes, and how failures and bad usage are reported.
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "kdb.h"
+#include "sitedeck-service-paths.h"
+#include "sitedeck-service-raii.h"
+#include "sitedeck-service-utils.h"
+#include "support/run_process.h"
+#include "support/seeded_deck.h"
+#include "support/service_harness.h"
+#include "support/stand_in_servers.h"
+#include "support/temp_root.h"
+
+namespace {
+
+class SitedeckTool : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    SeedItem news = seed_item(7, "https://news.example/", "News", 1);
+    news.dominant_color = "#AA0000";
+    news.icon_size = "4x3";
+    news.touch_icon_exists = 1;
+    news.favicon_exists = 1;
+    news.icon_data = seed_pixels(4, 3, 7);
+    SeedItem mail = seed_item(3, "https://mail.example/inbox", "Mail", 2);
+    SeedItem gone = seed_item(9, "https://gone.example/", "Gone", 3);
+    gone.dominant_color = "#000000";
+    gone.is_dirty = -1;
+    SeedItem long_title =
+        seed_item(5, "https://five.example/", "A very long title that will not fit the column", 4);
+    long_title.dominant_color = "#00FF00";
+    long_title.favicon_exists = 1;
+    const std::vector<SeedItem> items = {news, mail, gone, long_title};
+    ASSERT_TRUE(seed_deck(items));
+    ASSERT_TRUE(service_.start_activated(/*once=*/false));
+  }
+
+  ProcessResult sitedeck(const std::vector<std::string>& arguments) {
+    std::vector<std::string> argv = {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "--socket",
+                                     service_.socket_path()};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    return run_process(argv);
+  }
+
+  TempRoot root_;
+  ServiceHarness service_;
+};
+
+TEST_F(SitedeckTool, ListPrintsTheLiveItemsInDeckOrder) {
+  ProcessResult result = sitedeck({"list"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(
+      result.out,
+      "ID  TITLE                             URL                         COLOUR   ICON  FLAGS\n"
+      "7   News                              https://news.example/       #AA0000  4x3   "
+      "touch,favicon\n"
+      "3   Mail                              https://mail.example/inbox  -        -     -\n"
+      "5   A very long title that will n...  https://five.example/       #00FF00  -     "
+      "favicon\n");
+  EXPECT_EQ(result.err, "");
+}
+
+TEST_F(SitedeckTool, ShowPrintsEveryFieldAndNamesWhatIsNotStored) {
+  ProcessResult result = sitedeck({"show", "3"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out,
+            "id:                3\n"
+            "url:               https://mail.example/inbox\n"
+            "title:             Mail\n"
+            "dominant colour:   (none)\n"
+            "icon size:         (none)\n"
+            "touch icon exists: 0\n"
+            "favicon exists:    0\n"
+            "icon pixels:       (none)\n");
+  result = sitedeck({"show", "7"});
+  EXPECT_NE(result.out.find("icon pixels:       4x3, 48 bytes\n"), std::string::npos) << result.out;
+}
+
+TEST_F(SitedeckTool, IconWritesThePixelsBackAsPng) {
+  const std::string path = root_.dir() + "/news.png";
+  ProcessResult result = sitedeck({"icon", "7", "-o", path});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out.rfind(path + ": 4x3, ", 0), 0u) << result.out;
+
+  std::string png = read_file(path);
+  unsigned char* raw = nullptr;
+  int width = 0, height = 0, size = 0;
+  ASSERT_EQ(convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()), png.size(),
+                                    &raw, &width, &height, &size),
+            0);
+  UniqueMalloc<unsigned char> pixels(raw);
+  EXPECT_EQ(width, 4);
+  EXPECT_EQ(height, 3);
+  EXPECT_EQ(std::vector<uint8_t>(raw, raw + size), seed_pixels(4, 3, 7));
+}
+
+TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
+  struct Case {
+    std::vector<std::string> arguments;
+    std::string err;
+  } cases[] = {
+      {{"show", "99"}, "sitedeck: show: SDS_ERROR_ID_NOT_FOUND (8)\n"},
+      {{"icon", "3", "-o", root_.dir() + "/none.png"}, "sitedeck: icon: SDS_ERROR_NO_DATA (6)\n"},
+  };
+  for (const auto& c : cases) {
+    ProcessResult result = sitedeck(c.arguments);
+    ASSERT_TRUE(result.finished) << c.arguments[0];
+    EXPECT_EQ(result.exit_code, 1) << c.arguments[0];
+    EXPECT_EQ(result.err, c.err);
+    EXPECT_EQ(result.out, "") << c.arguments[0];
+  }
+  EXPECT_FALSE(file_exists(root_.dir() + "/none.png"));
+}
+
+TEST_F(SitedeckTool, BadUsageExitsWithTwo) {
+  for (const auto& arguments : std::vector<std::vector<std::string>>{
+           {"icon", "7"}, {"show", "x"}, {"show", "-1"}, {"init", "--lat", "1"}, {"frobnicate"}}) {
+    ProcessResult result = sitedeck(arguments);
+    ASSERT_TRUE(result.finished) << arguments[0];
+    EXPECT_EQ(result.exit_code, 2) << arguments[0] << " " << result.err;
+    EXPECT_EQ(result.out, "") << arguments[0];
+  }
+}
+
+TEST_F(SitedeckTool, NextUpdatePrintsTheSeconds) {
+  ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "7200"));
+  ProcessResult result = sitedeck({"next-update"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out, "7200\n");
+}
+
+// A pull through the stand-in servers: the result is printed by name, and
+// "not modified" counts as success as much as a new list does.
+TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
+  TempRoot root;
+  ContentServerProcess content;
+  GeocoderProcess geocoder;
+  ASSERT_TRUE(content.ok() && geocoder.ok());
+  ASSERT_TRUE(kdb_write("db/browser/sitedeck/geocoder_url", geocoder.root_url().c_str()));
+  ASSERT_TRUE(write_file(root.path(SDS_SERVER_DATA_XML),
+                         "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<values><Server><Id>1</Id>"
+                         "<Base-url>" +
+                             content.base_url() + "</Base-url>" +
+                             "<WaitTime>0</WaitTime><RetryCount>1</RetryCount>"
+                             "<FallBack>false</FallBack></Server></values>\n"));
+  ServiceHarness service;
+  ASSERT_TRUE(service.start_activated(/*once=*/false));
+  const std::string tool = std::string(SITEDECK_BIN_DIR) + "/sitedeck";
+  const std::string socket = service.socket_path();
+  const std::vector<std::string> init = {tool,   "--socket", socket, "init",      "--lat",
+                                         "37.5", "--lon",    "127",  "--version", "9.0"};
+
+  ProcessResult result = run_process(init);
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err << service.output();
+  EXPECT_EQ(result.out, "pull result: SDS_ERROR_NONE (0): a new item list was stored\n");
+  result = run_process({tool, "--socket", socket, "list"});
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_NE(result.out.find("\n1   Daily Herald "), std::string::npos) << result.out;
+
+  result = run_process(init);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.out, "pull result: SDS_ERROR_UNKNOWN (17): the stored item list is current\n");
+}
+
+}  // namespace

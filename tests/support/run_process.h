@@ -1,0 +1,17 @@
+// Runs a program to its end for a test and collects what it printed: standard
+// output and standard error separately, the exit code, all within a bound
+// (the program is killed when it runs over).
+#pragma once
+
+#include <string>
+#include <vector>
+
+struct ProcessResult {
+  bool finished = false;  // false: it could not start or ran over the bound
+  int exit_code = -1;     // -1 when it did not exit by itself
+  std::string out;
+  std::string err;
+};
+
+// `argv[0]` is the program's path; the environment is the test's own.
+ProcessResult run_process(const std::vector<std::string>& argv, int timeout_ms = 20000);
