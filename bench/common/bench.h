@@ -23,6 +23,13 @@ struct bench_result {
   std::string name;
   std::string description;
   std::string floor;
+  // The ratio to the floor is taken against floor x floor_scale: a pull of
+  // 5000 items beside the pull of 50 compares the time per item.
+  double floor_scale = 1.0;
+  // The goal: the median ratio to the floor (or, for a byte count with no
+  // floor, the median itself) must not exceed it. 0: none.
+  double target = 0.0;
+  bool bytes = false;               // samples are byte counts, not times
   std::vector<int64_t> samples_ns;  // one per timed iteration
   int repeated = 0;                 // iterations redone after a recovery
   bool failed = false;              // an iteration's body reported failure
@@ -41,6 +48,11 @@ struct bench_case {
   std::string floor;
   std::function<bool()> body;
   std::function<bool()> recover = {};
+  // Runs untimed before every try of an iteration (a fresh start state, say);
+  // false fails the iteration.
+  std::function<bool()> prepare = {};
+  double floor_scale = 1.0;  // as in bench_result
+  double target = 0.0;       // as in bench_result
 };
 
 // Runs every case `warmup` times untimed, then `iterations` times timed, the
@@ -67,7 +79,16 @@ class bench_report {
   bool any_failed() const;
 
  private:
+  struct bench_summary {
+    int64_t median = 0;
+    int64_t p99 = 0;
+    const bench_result* floor = nullptr;
+    double ratio_median = 0;  // 0 when there is no floor
+    double ratio_p99 = 0;
+    bool target_met = false;
+  };
   const bench_result* find(const std::string& name) const;
+  bench_summary summarise(const bench_result& r) const;
   std::vector<bench_result> results_;
 };
 
