@@ -1,4 +1,14 @@
-#include "pull_floor.h"
+// sitedeck_pull_floor: the floor of a data pull, one process doing only the
+// work no pull can avoid. It fetches the item list, reads it with json-glib,
+// picks each item's icon the way the service does, fetches those icons over
+// one reused libcurl handle (or `parallel` at a time with the multi
+// interface), decodes them to B, G, R, A rows with libpng and writes one row
+// per site into a fresh SQLite file in one transaction, with one prepared
+// statement. The benchmark starts it once per iteration, as the activator
+// starts a service process for every pull.
+//
+// Usage: sitedeck_pull_floor LIST_URL DB_PATH PARALLEL
+// Prints the number of rows stored with an icon; exit status 0 on success.
 
 #include <curl/curl.h>
 #include <json-glib/json-glib.h>
@@ -249,8 +259,13 @@ int store(const std::string& path, const std::vector<floor_site>& sites) {
   return ok ? with_icon : -1;
 }
 
-}  // namespace
+struct pull_floor_config {
+  std::string list_url;
+  std::string db_path;  // removed and made anew
+  int parallel = 1;     // 1: one reused easy handle; more: multi, this many at a time
+};
 
+// One pull; the number of rows stored with an icon, or -1 (reason on stderr).
 int pull_floor_run(const pull_floor_config& config) {
   Curl curl(curl_easy_init());
   std::string body;
@@ -278,4 +293,17 @@ int pull_floor_run(const pull_floor_config& config) {
     std::string().swap(site.png);
   }
   return store(config.db_path, sites);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  if (argc != 4) {
+    std::fprintf(stderr, "usage: sitedeck_pull_floor LIST_URL DB_PATH PARALLEL\n");
+    return 2;
+  }
+  int stored = pull_floor_run({argv[1], argv[2], std::atoi(argv[3])});
+  if (stored < 0) return 1;
+  std::printf("%d\n", stored);
+  return 0;
 }

@@ -4,13 +4,17 @@
 // location file already stored for the position sent, so the geocoder is
 // never asked. The stand-in content server synthesises the items (two icons
 // each; the 96 px RGBA one is chosen). Beside it the floor of
-// bench/floors/pull_floor.h fetches the same list and icons and writes the
+// bench/floors/pull_floor.cpp fetches the same list and icons and writes the
 // same rows in one process. Also measured: pulls of 500 and 5000 items per
 // item against the pull of 50, and the service's peak resident memory.
 #include <sqlite3.h>
-#include <sys/syscall.h>
 #include <poll.h>
+#include <spawn.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
 #include <unistd.h>
+
+#include <fcntl.h>
 
 #include <cerrno>
 #include <cstdio>
@@ -22,7 +26,6 @@
 #include <vector>
 
 #include "bench.h"
-#include "pull_floor.h"
 #include "scenarios.h"
 #include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
@@ -32,6 +35,8 @@
 #include "support/service_harness.h"
 #include "support/stand_in_servers.h"
 #include "support/temp_root.h"
+
+extern char** environ;
 
 namespace {
 
@@ -75,6 +80,42 @@ int64_t peak_rss(pid_t pid) {
     if (line.rfind("VmHWM:", 0) == 0) return std::atoll(line.c_str() + 6) * 1024;
   }
   return -1;
+}
+
+struct pull_floor_config {
+  std::string list_url;  // the signed item-list URL, as the service sends it
+  std::string db_path;   // removed and made anew by every run
+  int parallel = 1;      // 1: one reused easy handle; more: multi, this many at a time
+};
+
+// Runs the floor program once; the rows it stored with an icon, or -1.
+int pull_floor_run(const pull_floor_config& config) {
+  std::string program = std::string(SITEDECK_BIN_DIR) + "/sitedeck_pull_floor";
+  std::string parallel = std::to_string(config.parallel);
+  char* argv[] = {program.data(), const_cast<char*>(config.list_url.c_str()),
+                  const_cast<char*>(config.db_path.c_str()), parallel.data(), nullptr};
+  int fds[2];
+  if (pipe2(fds, O_CLOEXEC) != 0) return -1;
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_adddup2(&actions, fds[1], STDOUT_FILENO);
+  pid_t pid = -1;
+  int spawned = posix_spawn(&pid, program.c_str(), &actions, nullptr, argv, environ);
+  posix_spawn_file_actions_destroy(&actions);
+  close(fds[1]);
+  std::string out;
+  char buffer[64];
+  ssize_t n = 0;
+  while (spawned == 0 && (n = read(fds[0], buffer, sizeof buffer)) != 0) {
+    if (n > 0) out.append(buffer, static_cast<size_t>(n));
+    if (n < 0 && errno != EINTR) break;
+  }
+  close(fds[0]);
+  if (spawned != 0) return -1;
+  int status = 0;
+  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+  }
+  return WIFEXITED(status) && WEXITSTATUS(status) == 0 ? std::atoi(out.c_str()) : -1;
 }
 
 // count(*) and the summed icon bytes of the live rows of a database file.
