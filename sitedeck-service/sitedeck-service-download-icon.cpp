@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db-stmt-cache.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-request-server.h"
@@ -219,6 +220,8 @@ int sds_get_sitedeck_icons(sds_item** head) {
   std::vector<std::unique_ptr<IconTransfer>> transfers;
   std::map<std::string, IconTransfer*> by_url;
   int result = 0;
+  // The change test reads the same two columns for every item.
+  SdsDbStatementScope statements(sds_db_handle);
   for (sds_item* item = *head; item != nullptr; item = item->next) {
     if (item->ps_sds_icon_list == nullptr) continue;
     if (item->is_specially_removed) {

@@ -14,6 +14,7 @@
 #include <unordered_set>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db-stmt-cache.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
@@ -125,6 +126,8 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   }
   IconFileSweep sweep{head};
   if (!run("BEGIN IMMEDIATE")) return SDS_MERGE_NOT_COMMITTED;
+  // Every item runs the same few statements: prepare each once.
+  SdsDbStatementScope statements(sds_db_handle);
 
   int order = 1;
   for (sds_item* item = head; item != nullptr; item = item->next) {

@@ -4,7 +4,8 @@
 // Table and column names are constants of the service and are formatted into
 // the SQL text; every value is bound, except the URL of a delete, which is
 // quoted as one SQL string literal. Each call prepares, runs and finalizes its
-// own statements; nothing outlives it but the outputs it hands out.
+// own statements (or, inside an SdsDbStatementScope, reuses kept ones);
+// nothing outlives it but the outputs it hands out.
 #include <sqlite3.h>
 
 #include <cstdlib>
@@ -65,6 +66,10 @@ bool sds_db_prepare(sqlite3* handle, char* sql, SqliteStmt* stmt, int* error_cod
     SDS_LOGE("check available memory");
     return false;
   }
+  if (sqlite3_stmt* kept = sds_db_stmt_cache_take(handle, text.get())) {
+    stmt->reset(kept);
+    return true;
+  }
   sqlite3_stmt* raw = nullptr;
   int rc = sqlite3_prepare_v2(handle, text.get(), -1, &raw, nullptr);
   stmt->reset(raw);
@@ -73,6 +78,7 @@ bool sds_db_prepare(sqlite3* handle, char* sql, SqliteStmt* stmt, int* error_cod
     *error_code = sds_db_reason_or(handle, SDS_ERROR_INVALID_PARAMETER);
     return false;
   }
+  (void)sds_db_stmt_cache_keep(handle, text.get(), raw);
   return true;
 }
 

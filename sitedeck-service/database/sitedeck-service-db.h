@@ -2,7 +2,8 @@
 // one table `site_deck`, the mapping of SQLite results to SDS codes, and the
 // generic row and column operations every accessor is built on. Every
 // operation takes the connection first and reports a reason code through its
-// last argument; statements never outlive the call that prepared them.
+// last argument; statements never outlive the call that prepared them, except
+// inside an SdsDbStatementScope (sitedeck-service-db-stmt-cache.h).
 #pragma once
 
 #include <cstdint>
