@@ -31,6 +31,10 @@ bool run(const char* sql) {
 }
 
 // Pass 1 for one item: insert or refresh its row. `order` is its number.
+// The columns that the single-column accessors would write one after
+// another (the icon's four, the order number, the title, the colour and the
+// specially removed state) go into one UPDATE per item: inside the merge's
+// transaction the row ends the same, with a third of the statements.
 void merge_item(sds_item* item, int order) {
   if (item->site_name == nullptr || item->site_name[0] == '\0') {
     std::free(item->site_name);
@@ -38,19 +42,29 @@ void merge_item(sds_item* item, int order) {
   }
   int code = SDS_ERROR_NONE;
   int id = sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
-  if (id < 0) {
-    id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
-    (void)sds_store_sitedeck_icon_keep_file(id, item);
-    (void)update_sitedeck_order_index_to_db(id, &order);
-    (void)update_sitedeck_is_specially_removed(id, item->is_specially_removed);
-  } else {
-    (void)sds_store_sitedeck_icon_keep_file(id, item);
-    (void)update_sitedeck_order_index_to_db(id, &order);
-    (void)update_sitedeck_title_to_db(id, item->site_name);
-    if (item->predominant_color != nullptr) {
-      (void)update_sitedeck_predominant_color_to_db(id, item->predominant_color);
+  const bool stored = id >= 0;
+  if (!stored) id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
+
+  sds_icon_columns icon;
+  sds_db_column_value values[SDS_ICON_COLUMNS_MAX + 4];
+  int count = 0;
+  if (sds_load_sitedeck_icon_columns(item, &icon) == SDS_ERROR_NONE) {
+    count = sds_icon_columns_values(icon, values);
+  }
+  values[count++] = {"order_index", &order, 0, SDS_DB_COLUMN_TYPE_INT};
+  if (stored) {
+    if (item->site_name != nullptr) {
+      values[count++] = {"title", item->site_name, 0, SDS_DB_COLUMN_TYPE_TEXT};
     }
-    (void)update_sitedeck_is_specially_removed(id, item->is_specially_removed);
+    if (item->predominant_color != nullptr) {
+      values[count++] = {"dominant_color", item->predominant_color, 0, SDS_DB_COLUMN_TYPE_TEXT};
+    }
+  }
+  int is_dirty = item->is_specially_removed != 0 ? -1 : 1;
+  values[count++] = {"is_dirty", &is_dirty, 0, SDS_DB_COLUMN_TYPE_INT};
+  int write_code = SDS_ERROR_NONE;
+  if (sds_db_columns_replace(sds_db_handle, id, "site_deck", values, count, &write_code) != 0) {
+    SDS_LOGE("Error : %s", sds_error_string(write_code));
   }
   if (code != SDS_ERROR_NONE) SDS_LOGE("Error :: %s", sds_error_string(code));
 }
