@@ -88,6 +88,38 @@ TEST(DbOpen, FileMadeBeforeTheUrlIndexGetsItAndKeepsItsRows) {
   EXPECT_EQ(db.rows("SELECT count(*) FROM sqlite_master WHERE name = 'site_deck_url_index'"), "1");
 }
 
+int count_commit(void* commits) {
+  ++*static_cast<int*>(commits);
+  return 0;
+}
+
+TEST(DbOpen, TableAndUrlIndexAreMadeInOneTransaction) {
+  DbSession db(false);
+  sqlite3* handle = nullptr;
+  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &handle), SQLITE_OK);
+  int commits = 0;
+  sqlite3_commit_hook(handle, count_commit, &commits);
+  EXPECT_EQ(__rebuild_site_deck_tables(handle), 0);
+  EXPECT_EQ(commits, 1);
+  EXPECT_NE(sqlite3_get_autocommit(handle), 0);
+  sqlite3_close(handle);
+  EXPECT_EQ(rows_of_file(db.db_path(), "SELECT type, name FROM sqlite_master ORDER BY name"),
+            "table|site_deck\nindex|site_deck_url_index\nindex|sqlite_autoindex_site_deck_1");
+}
+
+TEST(DbOpen, TableThatCannotBeMadeLeavesNoTransactionOpen) {
+  DbSession db(false);
+  ASSERT_TRUE(write_file(db.db_path(), ""));
+  sqlite3* handle = nullptr;
+  ASSERT_EQ(sqlite3_open_v2(db.db_path().c_str(), &handle, SQLITE_OPEN_READONLY, nullptr),
+            SQLITE_OK);
+  LogCapture log;
+  EXPECT_EQ(__rebuild_site_deck_tables(handle), -1);
+  EXPECT_TRUE(log.contains("create tables:8 error:attempt to write a readonly database"));
+  EXPECT_NE(sqlite3_get_autocommit(handle), 0);
+  sqlite3_close(handle);
+}
+
 TEST(DbOpen, FileThatIsNoDatabaseIsReplacedByAnEmptyTable) {
   DbSession db(false);
   ASSERT_TRUE(write_file(db.db_path(), std::string(4096, 'g') + "garbage, not a database"));
