@@ -264,8 +264,11 @@ int sds_get_sitedeck_icons(sds_item** head) {
   std::vector<std::unique_ptr<IconTransfer>> transfers;
   std::map<std::string, IconTransfer*> by_url;
   {
-    // The change test reads the same two columns for every item.
+    // The change test reads the same two columns for every item: prepare
+    // them once, and read in one transaction rather than taking and
+    // releasing the file's lock (and checking for a journal) for each read.
     SdsDbStatementScope statements(sds_db_handle);
+    SdsDbReadTransaction reading(sds_db_handle);
     for (sds_item* item = *head; item != nullptr; item = item->next) {
       if (item->ps_sds_icon_list == nullptr) continue;
       if (item->is_specially_removed) {

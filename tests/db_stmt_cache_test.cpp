@@ -122,4 +122,23 @@ TEST_F(StatementScope, FailedStepIsLoggedAsOutsideAndTheStatementServesAgain) {
   EXPECT_EQ(db_.rows("SELECT id, title FROM site_deck ORDER BY id"), "2|B\n7|A");
 }
 
+TEST_F(StatementScope, ReadTransactionSpansItsReadsAndLeavesAnOuterOneOpen) {
+  {
+    SdsDbReadTransaction reading(sds_db_handle);
+    EXPECT_EQ(sqlite3_get_autocommit(sds_db_handle), 0);
+    EXPECT_EQ(read(1, "title"), "A");
+    EXPECT_EQ(read(2, "title"), "B");
+  }
+  EXPECT_NE(sqlite3_get_autocommit(sds_db_handle), 0);
+
+  ASSERT_TRUE(db_.exec("BEGIN IMMEDIATE; UPDATE site_deck SET title = 'A2' WHERE id = 1"));
+  {
+    SdsDbReadTransaction reading(sds_db_handle);
+    EXPECT_EQ(read(1, "title"), "A2");
+  }
+  EXPECT_EQ(sqlite3_get_autocommit(sds_db_handle), 0);
+  ASSERT_TRUE(db_.exec("ROLLBACK"));
+  EXPECT_EQ(read(1, "title"), "A");
+}
+
 }  // namespace

@@ -1,5 +1,6 @@
 // The statements kept by an SdsDbStatementScope: looked up by their SQL
-// text when prepared, reset instead of finalized when given back.
+// text when prepared, reset instead of finalized when given back. And the
+// read transaction of SdsDbReadTransaction.
 #include "database/sitedeck-service-db-stmt-cache.h"
 
 #include <sqlite3.h>
@@ -49,6 +50,19 @@ SdsDbStatementScope::~SdsDbStatementScope() {
   g_cache.kept.clear();
   g_cache.kept.shrink_to_fit();
   g_cache.handle = nullptr;
+}
+
+SdsDbReadTransaction::SdsDbReadTransaction(sqlite3* handle) {
+  if (handle == nullptr || sqlite3_get_autocommit(handle) == 0) return;
+  if (sqlite3_exec(handle, "BEGIN", nullptr, nullptr, nullptr) == SQLITE_OK) handle_ = handle;
+}
+
+SdsDbReadTransaction::~SdsDbReadTransaction() {
+  // A read transaction has nothing to lose: should COMMIT fail, roll back.
+  if (handle_ == nullptr || sqlite3_get_autocommit(handle_) != 0) return;
+  if (sqlite3_exec(handle_, "COMMIT", nullptr, nullptr, nullptr) != SQLITE_OK) {
+    (void)sqlite3_exec(handle_, "ROLLBACK", nullptr, nullptr, nullptr);
+  }
 }
 
 sqlite3_stmt* sds_db_stmt_cache_take(sqlite3* handle, const char* sql) {

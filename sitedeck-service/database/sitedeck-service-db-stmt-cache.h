@@ -1,4 +1,4 @@
-// Reuse of prepared statements within one bulk operation. A merge runs the
+// Helpers for bulk operations on the connection. Reuse of prepared statements: A merge runs the
 // same dozen statements once per listed item; preparing each anew costs more
 // than running it. While an SdsDbStatementScope lives, every statement the
 // database module prepares on that connection is kept when its operation is
@@ -21,6 +21,20 @@ class SdsDbStatementScope {
 
  private:
   bool owner_ = false;
+};
+
+// One read transaction around a run of reads: the file's lock is taken and
+// the journal looked for once, not for every statement. Does nothing when a
+// transaction is already open or cannot begin; ends it (COMMIT) when it goes.
+class SdsDbReadTransaction {
+ public:
+  explicit SdsDbReadTransaction(sqlite3* handle);
+  ~SdsDbReadTransaction();
+  SdsDbReadTransaction(const SdsDbReadTransaction&) = delete;
+  SdsDbReadTransaction& operator=(const SdsDbReadTransaction&) = delete;
+
+ private:
+  sqlite3* handle_ = nullptr;  // set when this object began the transaction
 };
 
 // A kept statement for `sql` on `handle`, marked in use, or null when no
