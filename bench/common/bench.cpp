@@ -168,9 +168,9 @@ std::string bench_report::markdown() const {
       target = "≤ " + (r.bytes ? amount(r, static_cast<int64_t>(r.target)) : fixed(r.target, 2)) +
                (s.target_met ? " ✓" : " ✗");
     }
-    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " +
-           amount(r, s.median) + " | " + amount(r, s.p99) + " | " + floor_cell + " | " +
-           ratio_median + " | " + ratio_p99 + " | " + target + " |\n";
+    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " + amount(r, s.median) +
+           " | " + amount(r, s.p99) + " | " + floor_cell + " | " + ratio_median + " | " +
+           ratio_p99 + " | " + target + " |\n";
   }
   for (const auto& r : results_) {
     if (r.repeated > 0) {
@@ -178,6 +178,7 @@ std::string bench_report::markdown() const {
              " iteration(s) repeated after a recovery (another process disturbed the run)\n";
     }
   }
+  for (const auto& n : notes_) out += "\n" + n + "\n";
   return out;
 }
 
@@ -200,7 +201,8 @@ std::string bench_report::json(const std::string& mode) const {
     const bench_summary s = summarise(r);
     out += ", \"unit\": \"" + std::string(r.bytes ? "bytes" : "ns") +
            "\", \"iterations\": " + std::to_string(r.samples_ns.size()) +
-           ", \"median_ns\": " + std::to_string(s.median) + ", \"p99_ns\": " + std::to_string(s.p99) +
+           ", \"median_ns\": " + std::to_string(s.median) +
+           ", \"p99_ns\": " + std::to_string(s.p99) +
            ", \"min_ns\": " + std::to_string(bench_quantile(r.samples_ns, 0.0)) +
            ", \"repeated\": " + std::to_string(r.repeated);
     if (s.floor != nullptr) {
@@ -217,6 +219,10 @@ std::string bench_report::json(const std::string& mode) const {
     }
     out += "}";
   }
-  out += "\n  ]\n}\n";
+  out += "\n  ],\n  \"notes\": [";
+  for (size_t i = 0; i < notes_.size(); ++i) {
+    out += (i == 0 ? "\"" : ", \"") + json_escape(notes_[i]) + "\"";
+  }
+  out += "]\n}\n";
   return out;
 }

@@ -70,6 +70,9 @@ int64_t bench_quantile(const std::vector<int64_t>& samples_ns, double q);
 class bench_report {
  public:
   void add(bench_result result);
+  // A line printed under the table (and listed in the JSON): a condition of
+  // the run that its numbers depend on.
+  void note(std::string text) { notes_.push_back(std::move(text)); }
   // Scenario's iteration count: `full`, or `quick` in a quick run.
   static int iterations(const bench_options& options, int full, int quick);
   // The Markdown table for people.
@@ -90,6 +93,7 @@ class bench_report {
   const bench_result* find(const std::string& name) const;
   bench_summary summarise(const bench_result& r) const;
   std::vector<bench_result> results_;
+  std::vector<std::string> notes_;
 };
 
 // A scenario group: measures its scenarios and adds them to the report.

@@ -46,7 +46,7 @@ using Curl = std::unique_ptr<CURL, CurlDeleter>;
 struct floor_site {
   std::string url, title, color, icon_url, icon_size, last_modified;
   int favicon = 0, touch = 0, removed = 0;
-  std::string png;               // the fetched icon file
+  std::string png;                  // the fetched icon file
   std::vector<unsigned char> bgra;  // its decoded rows
 };
 
@@ -78,9 +78,9 @@ int int_member(JsonObject* o, const char* name) {
 // The item list's sites with their chosen icon, in list order.
 bool read_list(const std::string& body, std::vector<floor_site>* sites) {
   JsonParser* parser = json_parser_new();
-  bool ok = json_parser_load_from_data(parser, body.data(), static_cast<gssize>(body.size()),
-                                       nullptr) &&
-            JSON_NODE_HOLDS_OBJECT(json_parser_get_root(parser));
+  bool ok =
+      json_parser_load_from_data(parser, body.data(), static_cast<gssize>(body.size()), nullptr) &&
+      JSON_NODE_HOLDS_OBJECT(json_parser_get_root(parser));
   for (const char* section : {"global", "regional"}) {
     if (!ok) break;
     JsonObject* root = json_node_get_object(json_parser_get_root(parser));

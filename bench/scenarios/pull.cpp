@@ -7,14 +7,14 @@
 // bench/floors/pull_floor.cpp fetches the same list and icons and writes the
 // same rows in one process. Also measured: pulls of 500 and 5000 items per
 // item against the pull of 50, and the service's peak resident memory.
-#include <sqlite3.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <spawn.h>
+#include <sqlite3.h>
+#include <sys/statfs.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <fcntl.h>
 
 #include <cerrno>
 #include <cstdio>
@@ -118,6 +118,27 @@ int pull_floor_run(const pull_floor_config& config) {
   return WIFEXITED(status) && WEXITSTATUS(status) == 0 ? std::atoi(out.c_str()) : -1;
 }
 
+// The kind of file system holding `dir`, which decides what a file costs.
+std::string file_system_of(const std::string& dir) {
+  struct statfs fs {};
+  if (statfs(dir.c_str(), &fs) != 0) return "unknown";
+  switch (static_cast<unsigned long>(fs.f_type)) {
+    case 0xEF53:
+      return "ext2/3/4";
+    case 0x01021994:
+      return "tmpfs";
+    case 0x9123683E:
+      return "btrfs";
+    case 0x58465342:
+      return "xfs";
+    default: {
+      char hex[32];
+      std::snprintf(hex, sizeof hex, "type 0x%lx", static_cast<unsigned long>(fs.f_type));
+      return hex;
+    }
+  }
+}
+
 // count(*) and the summed icon bytes of the live rows of a database file.
 std::pair<int64_t, int64_t> stored_totals(const std::string& path) {
   sqlite3* db = nullptr;
@@ -194,8 +215,7 @@ class PullRig {
       (void)std::remove(root_.path(path).c_str());
     }
     std::error_code ec;
-    for (const auto& entry :
-         std::filesystem::directory_iterator(root_.path(SDS_IMAGES_DIR), ec)) {
+    for (const auto& entry : std::filesystem::directory_iterator(root_.path(SDS_IMAGES_DIR), ec)) {
       std::filesystem::remove_all(entry.path(), ec);
     }
     return true;
@@ -223,6 +243,7 @@ class PullRig {
 
   std::string db_path() const { return root_.path(SDS_DB_PATH); }
   std::string floor_db_path() const { return root_.dir() + "/floor.db"; }
+  const std::string& dir() const { return root_.dir(); }
   int64_t last_peak_rss() const { return last_peak_rss_; }
 
  private:
@@ -278,6 +299,10 @@ void add_all(bench_report* report, std::vector<bench_result> results) {
 bool bench_group_pull(const bench_options& options, bench_report* report) {
   PullRig rig;
   if (!rig.start()) return false;
+  // Icon files, the database and its journal are made and removed on every
+  // pull: the file system under the scratch root weighs on the results.
+  report->note("pull: scratch root " + rig.dir() + " on " + file_system_of(rig.dir()) +
+               " (set TMPDIR to move it)");
   auto content = std::make_unique<ContentServerProcess>(std::vector<std::string>{"--items", "50"});
   if (!content->ok() || !rig.use(*content, 50)) return false;
   // One pull tells the floor which URL to ask.
@@ -293,26 +318,37 @@ bool bench_group_pull(const bench_options& options, bench_report* report) {
   const int iterations = bench_report::iterations(options, 30, 5);
   const int warmup = bench_report::iterations(options, 2, 1);
   add_all(report,
-          bench_time_cases(
-              "pull",
-              {{"floor-50", "one process: list, 50 icons over one reused handle, decode, one "
-                            "transaction",
-                "", run_floor(floor)},
-               {"pull-50", "connect, initialize: 50 items with icons from the stand-in server",
-                "floor-50", pull, {}, reset, 1.0, kPullTarget}},
-              iterations, warmup, 5));
+          bench_time_cases("pull",
+                           {{"floor-50",
+                             "one process: list, 50 icons over one reused handle, decode, one "
+                             "transaction",
+                             "", run_floor(floor)},
+                            {"pull-50",
+                             "connect, initialize: 50 items with icons from the stand-in server",
+                             "floor-50",
+                             pull,
+                             {},
+                             reset,
+                             1.0,
+                             kPullTarget}},
+                           iterations, warmup, 5));
 
   if (!content->control({{"delay_ms", std::to_string(kLatencyMs)}})) return false;
   pull_floor_config parallel = floor;
   parallel.parallel = 6;
-  add_all(report,
-          bench_time_cases(
-              "pull",
-              {{"floor-50-latency", "the floor with icons six at a time (multi), 50 ms per answer",
-                "", run_floor(parallel)},
-               {"pull-50-latency", "pull-50 with the server taking 50 ms for every answer",
-                "floor-50-latency", pull, {}, reset, 1.0, kLatencyTarget}},
-              bench_report::iterations(options, 15, 3), warmup, 5));
+  add_all(report, bench_time_cases("pull",
+                                   {{"floor-50-latency",
+                                     "the floor with icons six at a time (multi), 50 ms per answer",
+                                     "", run_floor(parallel)},
+                                    {"pull-50-latency",
+                                     "pull-50 with the server taking 50 ms for every answer",
+                                     "floor-50-latency",
+                                     pull,
+                                     {},
+                                     reset,
+                                     1.0,
+                                     kLatencyTarget}},
+                                   bench_report::iterations(options, 15, 3), warmup, 5));
   content.reset();
 
   std::vector<int> sizes = {500};
@@ -331,15 +367,21 @@ bool bench_group_pull(const bench_options& options, bench_report* report) {
     const double scale = items / 50.0;
     add_all(report,
             bench_time_cases("pull",
-                             {{name, "the pull with " + std::to_string(items) +
-                                         " items; ratio: time per item against pull-50",
-                               "pull-50", pull_and_measure, {}, reset, scale, kScaleTarget}},
+                             {{name,
+                               "the pull with " + std::to_string(items) +
+                                   " items; ratio: time per item against pull-50",
+                               "pull-50",
+                               pull_and_measure,
+                               {},
+                               reset,
+                               scale,
+                               kScaleTarget}},
                              bench_report::iterations(options, items >= 5000 ? 5 : 10, 3), 1, 5));
     bench_result rss;
     rss.group = "pull";
     rss.name = "peak-rss-" + std::to_string(items);
-    rss.description = "the service process's peak resident memory (VmHWM) in pull-" +
-                      std::to_string(items);
+    rss.description =
+        "the service process's peak resident memory (VmHWM) in pull-" + std::to_string(items);
     rss.bytes = true;
     rss.target = items >= 5000 ? kRssTarget : 0.0;
     rss.samples_ns = peaks;
