@@ -293,12 +293,18 @@ TEST_F(DbRows, SeveralColumnsRefusedWriteNone) {
   };
   const Case cases[] = {
       {"id 0", 0, {"title", "T", 0, SDS_DB_COLUMN_TYPE_TEXT}, "check id:0"},
-      {"null value", 1, {"title", nullptr, 0, SDS_DB_COLUMN_TYPE_TEXT},
+      {"null value",
+       1,
+       {"title", nullptr, 0, SDS_DB_COLUMN_TYPE_TEXT},
        "check materials for query id:1"},
-      {"null column", 1, {nullptr, "T", 0, SDS_DB_COLUMN_TYPE_TEXT},
+      {"null column",
+       1,
+       {nullptr, "T", 0, SDS_DB_COLUMN_TYPE_TEXT},
        "check materials for query id:1"},
       {"unknown type", 1, {"title", "T", 0, 9}, "invalid type:9"},
-      {"negative blob length", 1, {"icon_data", "T", -1, SDS_DB_COLUMN_TYPE_BLOB},
+      {"negative blob length",
+       1,
+       {"icon_data", "T", -1, SDS_DB_COLUMN_TYPE_BLOB},
        "check materials for query id:1"},
   };
   for (const Case& c : cases) {

@@ -34,8 +34,9 @@ class StatementScope : public ::testing::Test {
  protected:
   void SetUp() override {
     ASSERT_NE(sds_db_handle, nullptr);
-    ASSERT_TRUE(db_.exec("INSERT INTO site_deck(id, url, title) VALUES (1, 'https://a.example/', "
-                         "'A'), (2, 'https://b.example/', 'B')"));
+    ASSERT_TRUE(
+        db_.exec("INSERT INTO site_deck(id, url, title) VALUES (1, 'https://a.example/', "
+                 "'A'), (2, 'https://b.example/', 'B')"));
   }
   DbSession db_;
 };

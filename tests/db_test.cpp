@@ -69,9 +69,11 @@ TEST(DbOpen, FileMadeBeforeTheUrlIndexGetsItAndKeepsItsRows) {
   DbSession db(false);
   sqlite3* other = nullptr;
   ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &other), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(other, (std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')").c_str(),
-                         nullptr, nullptr, nullptr),
-            SQLITE_OK);
+  ASSERT_EQ(
+      sqlite3_exec(other,
+                   (std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')").c_str(),
+                   nullptr, nullptr, nullptr),
+      SQLITE_OK);
   sqlite3_close(other);
 
   LogCapture log;

@@ -195,8 +195,8 @@ TEST_F(Merge, ItemsWrittenInOneUpdateEndAsWithTheSingleColumnWrites) {
   for (sds_item* item = sds_item_list_head; item != nullptr; item = item->next, ++order) {
     if (item->site_name == nullptr) item->site_name = strdup(item->site_url);
     int code = 0;
-    int id = sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url,
-                                            &code);
+    int id =
+        sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
     const bool stored = id >= 0;
     if (!stored) id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
     if (item->ps_sds_icon_list != nullptr) {

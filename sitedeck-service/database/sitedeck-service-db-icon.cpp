@@ -170,8 +170,8 @@ int load_item_icon(const sds_item* item, sds_icon_columns* out, UniqueCStr* path
 
 // Writes one icon column; the code replaces `code` and is logged if not 0.
 void write_icon_column(int id, const sds_db_column_value& value, int* code) {
-  (void)sds_db_column_replace(sds_db_handle, id, kSiteDeck, value.column, value.value,
-                              value.length, value.value_type, code);
+  (void)sds_db_column_replace(sds_db_handle, id, kSiteDeck, value.column, value.value, value.length,
+                              value.value_type, code);
   if (*code != SDS_ERROR_NONE) SDS_LOGE("Error : %s", sds_error_string(*code));
 }
 

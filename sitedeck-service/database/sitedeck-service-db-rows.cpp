@@ -291,10 +291,9 @@ int sds_db_columns_replace(sqlite3* handle, int id, const char* table,
     return -1;
   }
   SqliteStmt stmt;
-  if (!sds_db_prepare(handle,
-                      sqlite3_mprintf("UPDATE %s SET %s WHERE %s IS ?", table, assignments.get(),
-                                      "id"),
-                      &stmt, error_code)) {
+  if (!sds_db_prepare(
+          handle, sqlite3_mprintf("UPDATE %s SET %s WHERE %s IS ?", table, assignments.get(), "id"),
+          &stmt, error_code)) {
     return -1;
   }
   for (int i = 0; i < count; ++i) {

@@ -77,8 +77,8 @@ sqlite3_stmt* sds_db_stmt_cache_take(sqlite3* handle, const char* sql) {
 }
 
 bool sds_db_stmt_cache_keep(sqlite3* handle, const char* sql, sqlite3_stmt* stmt) {
-  if (g_cache.handle == nullptr || handle != g_cache.handle || sql == nullptr ||
-      stmt == nullptr || g_cache.kept.size() >= kMaxKept) {
+  if (g_cache.handle == nullptr || handle != g_cache.handle || sql == nullptr || stmt == nullptr ||
+      g_cache.kept.size() >= kMaxKept) {
     return false;
   }
   try {
