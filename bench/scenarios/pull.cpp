@@ -11,6 +11,7 @@
 #include <poll.h>
 #include <spawn.h>
 #include <sqlite3.h>
+#include <sys/resource.h>
 #include <sys/statfs.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -88,8 +89,9 @@ struct pull_floor_config {
   int parallel = 1;      // 1: one reused easy handle; more: multi, this many at a time
 };
 
-// Runs the floor program once; the rows it stored with an icon, or -1.
-int pull_floor_run(const pull_floor_config& config) {
+// Runs the floor program once; the rows it stored with an icon, or -1. Its
+// CPU time goes to `cpu` when given.
+int pull_floor_run(const pull_floor_config& config, std::vector<int64_t>* cpu = nullptr) {
   std::string program = std::string(SITEDECK_BIN_DIR) + "/sitedeck_pull_floor";
   std::string parallel = std::to_string(config.parallel);
   char* argv[] = {program.data(), const_cast<char*>(config.list_url.c_str()),
@@ -113,7 +115,12 @@ int pull_floor_run(const pull_floor_config& config) {
   close(fds[0]);
   if (spawned != 0) return -1;
   int status = 0;
-  while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+  struct rusage usage {};
+  while (wait4(pid, &status, 0, &usage) < 0 && errno == EINTR) {
+  }
+  if (cpu != nullptr) {
+    cpu->push_back((usage.ru_utime.tv_sec + usage.ru_stime.tv_sec) * 1000000000LL +
+                   (usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) * 1000LL);
   }
   return WIFEXITED(status) && WEXITSTATUS(status) == 0 ? std::atoi(out.c_str()) : -1;
 }
@@ -137,6 +144,24 @@ std::string file_system_of(const std::string& dir) {
       return hex;
     }
   }
+}
+
+// CPU time `pid` has used so far, all its threads, in nanoseconds; -1 when
+// it cannot be read.
+int64_t cpu_ns(pid_t pid) {
+  std::error_code ec;
+  int64_t total = 0;
+  bool any = false;
+  for (const auto& task :
+       std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", ec)) {
+    std::ifstream in(task.path() / "schedstat");
+    int64_t on_cpu = 0;
+    if (in >> on_cpu) {
+      total += on_cpu;
+      any = true;
+    }
+  }
+  return any ? total : -1;
 }
 
 // count(*) and the summed icon bytes of the live rows of a database file.
@@ -227,7 +252,10 @@ class PullRig {
     if (service_.connect(&connection, 600000) != SDS_ERROR_NONE) return false;
     int result = sds_client_initialize(connection, kLatitude, kLongitude, kVersion);
     last_service_ = first_child(service_.pid());
-    if (last_service_ > 0) last_peak_rss_ = peak_rss(last_service_);
+    if (last_service_ > 0) {
+      last_peak_rss_ = peak_rss(last_service_);
+      last_cpu_ns_ = cpu_ns(last_service_);
+    }
     if (result != SDS_ERROR_NONE) {
       std::fprintf(stderr, "bench: pull: initialize answered %d\n", result);
       return false;
@@ -245,6 +273,8 @@ class PullRig {
   std::string floor_db_path() const { return root_.dir() + "/floor.db"; }
   const std::string& dir() const { return root_.dir(); }
   int64_t last_peak_rss() const { return last_peak_rss_; }
+  // CPU time of the last pull's service process up to its answer, start included.
+  int64_t last_cpu_ns() const { return last_cpu_ns_; }
 
  private:
   TempRoot root_;
@@ -253,6 +283,7 @@ class PullRig {
   int items_ = 0;
   pid_t last_service_ = -1;
   int64_t last_peak_rss_ = -1;
+  int64_t last_cpu_ns_ = -1;
 };
 
 // Runs one pull and the floor once, and checks that both stored the same
@@ -294,6 +325,32 @@ void add_all(bench_report* report, std::vector<bench_result> results) {
   for (auto& result : results) report->add(std::move(result));
 }
 
+// CPU time per iteration, collected beside the wall-clock time. On a busy
+// machine it shows what the process itself spent, without the waits for a
+// core; the waits for the disk are not in it.
+struct cpu_samples {
+  std::vector<int64_t> ns;
+  int warmup = 0;  // the first samples, taken during the warm-up, are dropped
+};
+
+void add_cpu(bench_report* report, const std::string& name, const std::string& of,
+             const std::string& floor, double floor_scale, const cpu_samples& cpu) {
+  bench_result r;
+  r.group = "pull";
+  r.name = name;
+  r.description = "CPU time (user + system, all threads) of " + of;
+  r.floor = floor;
+  r.floor_scale = floor_scale;
+  for (size_t i = static_cast<size_t>(cpu.warmup); i < cpu.ns.size(); ++i) {
+    if (cpu.ns[i] >= 0) r.samples_ns.push_back(cpu.ns[i]);
+  }
+  if (r.samples_ns.empty()) {
+    r.failed = true;
+    r.failure = "no measurement";
+  }
+  report->add(std::move(r));
+}
+
 }  // namespace
 
 bool bench_group_pull(const bench_options& options, bench_report* report) {
@@ -310,45 +367,58 @@ bool bench_group_pull(const bench_options& options, bench_report* report) {
   pull_floor_config floor{rig.last_list_url(), rig.floor_db_path(), 1};
   if (!same_as_floor(rig, floor, 50)) return false;
   auto reset = [&] { return rig.reset(); };
-  auto pull = [&] { return rig.pull(); };
-  auto run_floor = [&](const pull_floor_config& config) {
-    return [config] { return pull_floor_run(config) == 50; };
-  };
-
   const int iterations = bench_report::iterations(options, 30, 5);
   const int warmup = bench_report::iterations(options, 2, 1);
+  cpu_samples floor_cpu{{}, warmup}, pull_cpu{{}, warmup};
+  auto pull_into = [&](cpu_samples* cpu) {
+    return [&rig, cpu] {
+      bool ok = rig.pull();
+      if (ok) cpu->ns.push_back(rig.last_cpu_ns());
+      return ok;
+    };
+  };
+  auto run_floor = [&](const pull_floor_config& config, cpu_samples* cpu) {
+    return [config, cpu] { return pull_floor_run(config, &cpu->ns) == 50; };
+  };
+
   add_all(report,
           bench_time_cases("pull",
                            {{"floor-50",
                              "one process: list, 50 icons over one reused handle, decode, one "
                              "transaction",
-                             "", run_floor(floor)},
+                             "", run_floor(floor, &floor_cpu)},
                             {"pull-50",
                              "connect, initialize: 50 items with icons from the stand-in server",
                              "floor-50",
-                             pull,
+                             pull_into(&pull_cpu),
                              {},
                              reset,
                              1.0,
                              kPullTarget}},
                            iterations, warmup, 5));
+  add_cpu(report, "floor-50-cpu", "floor-50", "", 1.0, floor_cpu);
+  add_cpu(report, "pull-50-cpu", "the service process in pull-50", "floor-50-cpu", 1.0, pull_cpu);
 
   if (!content->control({{"delay_ms", std::to_string(kLatencyMs)}})) return false;
   pull_floor_config parallel = floor;
   parallel.parallel = 6;
+  cpu_samples floor_latency_cpu{{}, warmup}, pull_latency_cpu{{}, warmup};
   add_all(report, bench_time_cases("pull",
                                    {{"floor-50-latency",
                                      "the floor with icons six at a time (multi), 50 ms per answer",
-                                     "", run_floor(parallel)},
+                                     "", run_floor(parallel, &floor_latency_cpu)},
                                     {"pull-50-latency",
                                      "pull-50 with the server taking 50 ms for every answer",
                                      "floor-50-latency",
-                                     pull,
+                                     pull_into(&pull_latency_cpu),
                                      {},
                                      reset,
                                      1.0,
                                      kLatencyTarget}},
                                    bench_report::iterations(options, 15, 3), warmup, 5));
+  add_cpu(report, "floor-50-latency-cpu", "floor-50-latency", "", 1.0, floor_latency_cpu);
+  add_cpu(report, "pull-50-latency-cpu", "the service process in pull-50-latency",
+          "floor-50-latency-cpu", 1.0, pull_latency_cpu);
   content.reset();
 
   std::vector<int> sizes = {500};
@@ -358,9 +428,13 @@ bool bench_group_pull(const bench_options& options, bench_report* report) {
         std::vector<std::string>{"--items", std::to_string(items)});
     if (!content->ok() || !rig.use(*content, items)) return false;
     std::vector<int64_t> peaks;
+    cpu_samples cpu{{}, 1};
     auto pull_and_measure = [&] {
       bool ok = rig.pull();
-      if (ok) peaks.push_back(rig.last_peak_rss());
+      if (ok) {
+        peaks.push_back(rig.last_peak_rss());
+        cpu.ns.push_back(rig.last_cpu_ns());
+      }
       return ok;
     };
     const std::string name = "pull-" + std::to_string(items);
@@ -377,6 +451,8 @@ bool bench_group_pull(const bench_options& options, bench_report* report) {
                                scale,
                                kScaleTarget}},
                              bench_report::iterations(options, items >= 5000 ? 5 : 10, 3), 1, 5));
+    add_cpu(report, name + "-cpu", "the service process in " + name + ", per item against pull-50",
+            "pull-50-cpu", scale, cpu);
     bench_result rss;
     rss.group = "pull";
     rss.name = "peak-rss-" + std::to_string(items);
