@@ -21,6 +21,7 @@ struct bench_group {
 constexpr bench_group kGroups[] = {
     {"queries", bench_group_queries},
     {"deck", bench_group_deck},
+    {"pull", bench_group_pull},
 };
 
 void usage(FILE* out) {

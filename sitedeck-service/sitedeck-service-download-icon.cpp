@@ -1,13 +1,11 @@
 // Icon download: after an item list is parsed, each item keeps one chosen touch
 // icon, fetched into the images directory when it differs from the stored one,
-// or no icon at all. Downloads run a few at a time over reused connections,
-// each holding its file and handle only while it runs; the outcome per item
-// is the same as fetching them one by one in list order.
+// or no icon at all. Downloads run a few at a time over reused connections;
+// the outcome per item is the same as fetching them one by one in list order.
 #include "sitedeck-service-download-icon.h"
 
 #include <curl/curl.h>
 
-#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <map>
@@ -16,6 +14,7 @@
 #include <vector>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db-stmt-cache.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-request-server.h"
@@ -51,132 +50,159 @@ size_t write_icon_block(char* data, size_t size, size_t count, void* user) {
   return items;
 }
 
-// One transfer: the icon, its target file and the texts the handle points at.
-// The file and the handle exist only while the transfer runs.
+// One icon to fetch into its file. Its handle and its open file exist only
+// while it runs, so a list of thousands never holds thousands of either.
 struct IconTransfer {
   sds_icon* icon = nullptr;
-  std::string path;
-  UniqueCurl curl;
   IconSink sink;
-  UniqueCStr user_agent;
-  UniqueCStr proxy;
-  bool created = false;  // the file was made, and must go if the transfer fails
-  bool done = false;
+  std::string path;      // the icon's file, once it was made
   bool ok = false;
 };
 
-// Names the file of `icon`'s transfer; false when it cannot have one.
-bool prepare_transfer(sds_icon* icon, IconTransfer* transfer) {
-  transfer->icon = icon;
-  UniqueCStr path(get_icon_path(icon->icon_path));
-  if (!path) return false;
-  transfer->path = path.get();
-  return true;
+// The file of a transfer that did not complete goes, so that no partial icon
+// is left in the images directory.
+void drop_partial_file(IconTransfer* t) {
+  t->sink.file.reset();
+  if (!t->ok && !t->path.empty()) (void)std::remove(t->path.c_str());
 }
 
-// Opens the file and sets up the handle just before the transfer runs: a
-// list of a thousand sites must not hold a thousand files and handles open
-// at once (descriptors run out at 1024, and the database needs some too).
-bool start_transfer(IconTransfer* transfer) {
-  transfer->curl.reset(curl_easy_init());
-  if (!transfer->curl) return false;
-  transfer->sink.file.reset(std::fopen(transfer->path.c_str(), "wb"));
-  if (!transfer->sink.file) {
-    SDS_LOGE("[CRITICAL]  Unable to open Image File");
-    return false;
-  }
-  transfer->created = true;
-  CURL* curl = transfer->curl.get();
-  char* user_agent = nullptr;
-  char* proxy = nullptr;
-  int code = sds_transfer_apply_settings(curl, &user_agent, &proxy);
-  transfer->user_agent.reset(user_agent);
-  transfer->proxy.reset(proxy);
-  if (code != SDS_ERROR_NONE) return false;
-  (void)curl_easy_setopt(curl, CURLOPT_URL, transfer->icon->icon_path);
-  (void)curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, write_icon_block);
-  (void)curl_easy_setopt(curl, CURLOPT_WRITEDATA, &transfer->sink);
-  (void)curl_easy_setopt(curl, CURLOPT_MAXFILESIZE_LARGE,
-                         static_cast<curl_off_t>(SDS_MAX_ICON_BYTES));
-  return true;
-}
-
-// Releases what a transfer held while it ran; the file of a failed one goes
-// too, so that no partial icon is left in the images directory.
-void end_transfer(IconTransfer* transfer) {
-  transfer->done = true;
-  transfer->sink.file.reset();
-  transfer->curl.reset();
-  transfer->user_agent.reset();
-  transfer->proxy.reset();
-  if (!transfer->ok && transfer->created) (void)std::remove(transfer->path.c_str());
-}
-
-// Checks a finished transfer the way a single download is judged.
-bool finish_transfer(IconTransfer* transfer, CURLcode result) {
+// Checks a finished transfer the way a single download is judged, and
+// closes its file.
+bool finish_transfer(CURL* curl, IconSink* sink, CURLcode result) {
   if (result != CURLE_OK) {
     SDS_LOGE("[CRITICAL] Failed to perform easy perfomr[%d] \n", static_cast<int>(result));
     return false;
   }
   long status = 0;
-  CURLcode info = curl_easy_getinfo(transfer->curl.get(), CURLINFO_RESPONSE_CODE, &status);
+  CURLcode info = curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
   if (info != CURLE_OK) {
     SDS_LOGE("[CRITICAL] curl_easy_getinfo Failed: CURLINFO_HTTP_CODE with error code[%d] \n",
              static_cast<int>(info));
     return false;
   }
   curl_off_t downloaded = 0;
-  info = curl_easy_getinfo(transfer->curl.get(), CURLINFO_SIZE_DOWNLOAD_T, &downloaded);
+  info = curl_easy_getinfo(curl, CURLINFO_SIZE_DOWNLOAD_T, &downloaded);
   if (info != CURLE_OK) {
     SDS_LOGE("[CRITICAL] curl_easy_getinfo Failed : CURLINFO_SIZE_DOWNLOAD with error code[%d]",
              static_cast<int>(info));
     return false;
   }
   // The status is not judged here: a body that is no PNG is refused when stored.
-  return std::fclose(transfer->sink.file.release()) == 0;
+  return std::fclose(sink->file.release()) == 0;
 }
 
-// Runs the transfers, at most kMaxParallelDownloads at a time.
-void run_transfers(std::vector<std::unique_ptr<IconTransfer>>& transfers) {
-  UniqueCurlMulti multi(curl_multi_init());
-  if (!multi) return;
-  (void)curl_multi_setopt(multi.get(), CURLMOPT_MAX_TOTAL_CONNECTIONS,
-                          static_cast<long>(kMaxParallelDownloads));
-  std::map<CURL*, IconTransfer*> by_handle;
+// The handles that fetch icons, kMaxParallelDownloads at most. A handle keeps
+// its settings (user agent, proxy, limits) from icon to icon, and the multi
+// handle keeps the connections, so a connection to a server carries one
+// request after another instead of one request each.
+class IconFetcher {
+ public:
+  IconFetcher();
+  // Fetches the transfers in list order, at most kMaxParallelDownloads at a
+  // time; each ends with `ok` telling whether it completed into its file.
+  void run(const std::vector<IconTransfer*>& transfers);
+
+ private:
+  // Starts `t` on a free handle; false when it cannot start.
+  bool start(IconTransfer* t);
+  // A configured handle from the pool, or a new one; null when none can be made.
+  CURL* take_handle();
+  void give_back(CURL* curl) { idle_.emplace_back(curl); }
+
+  UniqueCurlMulti multi_;
+  std::vector<UniqueCurl> idle_;
+  std::map<CURL*, IconTransfer*> running_;
+};
+
+IconFetcher::IconFetcher() : multi_(curl_multi_init()) {
+  if (!multi_) return;
+  const auto parallel = static_cast<long>(kMaxParallelDownloads);
+  (void)curl_multi_setopt(multi_.get(), CURLMOPT_MAX_TOTAL_CONNECTIONS, parallel);
+  (void)curl_multi_setopt(multi_.get(), CURLMOPT_MAX_HOST_CONNECTIONS, parallel);
+  // One request at a time on a connection: no pipelining, no multiplexing.
+  (void)curl_multi_setopt(multi_.get(), CURLMOPT_PIPELINING, static_cast<long>(CURLPIPE_NOTHING));
+}
+
+CURL* IconFetcher::take_handle() {
+  if (!idle_.empty()) {
+    CURL* curl = idle_.back().release();
+    idle_.pop_back();
+    return curl;
+  }
+  UniqueCurl curl(curl_easy_init());
+  if (!curl) return nullptr;
+  char* user_agent = nullptr;
+  char* proxy = nullptr;
+  int code = sds_transfer_apply_settings(curl.get(), &user_agent, &proxy);
+  // The handle keeps copies of the texts it is given.
+  std::free(user_agent);
+  std::free(proxy);
+  if (code != SDS_ERROR_NONE) return nullptr;
+  (void)curl_easy_setopt(curl.get(), CURLOPT_WRITEFUNCTION, write_icon_block);
+  (void)curl_easy_setopt(curl.get(), CURLOPT_MAXFILESIZE_LARGE,
+                         static_cast<curl_off_t>(SDS_MAX_ICON_BYTES));
+  return curl.release();
+}
+
+bool IconFetcher::start(IconTransfer* t) {
+  UniqueCStr path(get_icon_path(t->icon->icon_path));
+  if (!path) return false;
+  CURL* curl = take_handle();
+  if (curl == nullptr) return false;
+  t->sink.file.reset(std::fopen(path.get(), "wb"));
+  if (!t->sink.file) {
+    SDS_LOGE("[CRITICAL]  Unable to open Image File");
+    give_back(curl);
+    return false;
+  }
+  t->path = path.get();
+  (void)curl_easy_setopt(curl, CURLOPT_URL, t->icon->icon_path);
+  (void)curl_easy_setopt(curl, CURLOPT_WRITEDATA, &t->sink);
+  if (curl_multi_add_handle(multi_.get(), curl) != CURLM_OK) {
+    drop_partial_file(t);
+    give_back(curl);
+    return false;
+  }
+  running_[curl] = t;
+  return true;
+}
+
+void IconFetcher::run(const std::vector<IconTransfer*>& transfers) {
+  if (!multi_) return;
   size_t next = 0;
-  int running = 0;
-  auto add_more = [&] {
-    while (next < transfers.size() && static_cast<int>(by_handle.size()) < kMaxParallelDownloads) {
-      IconTransfer* t = transfers[next++].get();
-      if (start_transfer(t) && curl_multi_add_handle(multi.get(), t->curl.get()) == CURLM_OK) {
-        by_handle[t->curl.get()] = t;
-      } else {
-        end_transfer(t);
-      }
+  auto start_more = [&] {
+    while (next < transfers.size() && static_cast<int>(running_.size()) < kMaxParallelDownloads) {
+      (void)start(transfers[next++]);
     }
   };
-  add_more();
-  while (!by_handle.empty()) {
-    if (curl_multi_perform(multi.get(), &running) != CURLM_OK) break;
+  start_more();
+  int still_running = 0;
+  while (!running_.empty()) {
+    if (curl_multi_perform(multi_.get(), &still_running) != CURLM_OK) break;
     int queued = 0;
-    while (CURLMsg* msg = curl_multi_info_read(multi.get(), &queued)) {
+    while (CURLMsg* msg = curl_multi_info_read(multi_.get(), &queued)) {
       if (msg->msg != CURLMSG_DONE) continue;
-      auto found = by_handle.find(msg->easy_handle);
-      if (found == by_handle.end()) continue;
+      auto found = running_.find(msg->easy_handle);
+      if (found == running_.end()) continue;
+      CURL* curl = found->first;
       IconTransfer* t = found->second;
-      t->ok = finish_transfer(t, msg->data.result);
-      (void)curl_multi_remove_handle(multi.get(), msg->easy_handle);
-      by_handle.erase(found);
-      end_transfer(t);
+      running_.erase(found);
+      t->ok = finish_transfer(curl, &t->sink, msg->data.result);
+      drop_partial_file(t);
+      (void)curl_multi_remove_handle(multi_.get(), curl);
+      give_back(curl);
     }
-    add_more();
-    if (by_handle.empty()) break;
-    if (curl_multi_poll(multi.get(), nullptr, 0, 1000, nullptr) != CURLM_OK) break;
+    start_more();
+    if (running_.empty()) break;
+    if (curl_multi_poll(multi_.get(), nullptr, 0, 1000, nullptr) != CURLM_OK) break;
   }
-  for (auto& [handle, t] : by_handle) {
-    (void)curl_multi_remove_handle(multi.get(), handle);
-    end_transfer(t);
+  // Left running only when the multi interface failed: those did not complete.
+  for (auto& [curl, t] : running_) {
+    drop_partial_file(t);
+    (void)curl_multi_remove_handle(multi_.get(), curl);
+    give_back(curl);
   }
+  running_.clear();
 }
 
 // True when the stored icon of `site_url` has this path and time stamp.
@@ -233,11 +259,10 @@ void sds_keep_only_icon(sds_icon** head, sds_icon* chosen) {
 int sds_download_icon(sds_icon* icon) {
   if (icon == nullptr) return -1;
   sds_transfer_global_init();
-  std::vector<std::unique_ptr<IconTransfer>> transfers;
-  transfers.push_back(std::make_unique<IconTransfer>());
-  if (!prepare_transfer(icon, transfers.back().get())) return -1;
-  run_transfers(transfers);
-  return transfers.back()->ok ? 0 : -1;
+  IconTransfer transfer;
+  transfer.icon = icon;
+  IconFetcher().run({&transfer});
+  return transfer.ok ? 0 : -1;
 }
 
 int sds_get_sitedeck_icons(sds_item** head) {
@@ -247,38 +272,46 @@ int sds_get_sitedeck_icons(sds_item** head) {
   std::vector<std::pair<sds_item*, IconTransfer*>> pending;
   std::vector<std::unique_ptr<IconTransfer>> transfers;
   std::map<std::string, IconTransfer*> by_url;
-  int result = 0;
-  for (sds_item* item = *head; item != nullptr; item = item->next) {
-    if (item->ps_sds_icon_list == nullptr) continue;
-    if (item->is_specially_removed) {
-      SDS_LOGE("Item is specially removed from server, hence no need to download Icon");
-      drop_icons(item);
-      continue;
+  {
+    // The change test reads the same two columns for every item: prepare
+    // them once, and read in one transaction rather than taking and
+    // releasing the file's lock (and checking for a journal) for each read.
+    SdsDbStatementScope statements(sds_db_handle);
+    SdsDbReadTransaction reading(sds_db_handle);
+    for (sds_item* item = *head; item != nullptr; item = item->next) {
+      if (item->ps_sds_icon_list == nullptr) continue;
+      if (item->is_specially_removed) {
+        SDS_LOGE("Item is specially removed from server, hence no need to download Icon");
+        drop_icons(item);
+        continue;
+      }
+      sds_icon* chosen = sds_choose_icon(item->ps_sds_icon_list);
+      if (item->site_url != nullptr && icon_unchanged(item->site_url, chosen)) {
+        SDS_LOGE("Icon last modified time is not changed so not downloading icon");
+        drop_icons(item);
+        continue;
+      }
+      sds_keep_only_icon(&item->ps_sds_icon_list, chosen);
+      IconTransfer* transfer = nullptr;
+      std::string url = chosen->icon_path != nullptr ? chosen->icon_path : "";
+      auto same_url = by_url.find(url);
+      if (!url.empty() && same_url != by_url.end()) {
+        transfer = same_url->second;  // one file serves every item naming this URL
+      } else {
+        transfers.push_back(std::make_unique<IconTransfer>());
+        transfer = transfers.back().get();
+        transfer->icon = chosen;
+        if (!url.empty()) by_url[url] = transfer;
+      }
+      pending.emplace_back(item, transfer);
     }
-    sds_icon* chosen = sds_choose_icon(item->ps_sds_icon_list);
-    if (item->site_url != nullptr && icon_unchanged(item->site_url, chosen)) {
-      SDS_LOGE("Icon last modified time is not changed so not downloading icon");
-      drop_icons(item);
-      continue;
-    }
-    sds_keep_only_icon(&item->ps_sds_icon_list, chosen);
-    IconTransfer* transfer = nullptr;
-    std::string url = chosen->icon_path != nullptr ? chosen->icon_path : "";
-    auto same_url = by_url.find(url);
-    if (!url.empty() && same_url != by_url.end()) {
-      transfer = same_url->second;  // one file serves every item naming this URL
-    } else {
-      transfers.push_back(std::make_unique<IconTransfer>());
-      transfer = transfers.back().get();
-      if (!prepare_transfer(chosen, transfer)) transfer->done = true;
-      if (!url.empty()) by_url[url] = transfer;
-    }
-    pending.emplace_back(item, transfer);
   }
-  std::vector<std::unique_ptr<IconTransfer>> startable;
-  std::vector<std::unique_ptr<IconTransfer>> finished;
-  for (auto& t : transfers) (t->done ? finished : startable).push_back(std::move(t));
-  run_transfers(startable);
+  std::vector<IconTransfer*> in_order;
+  in_order.reserve(transfers.size());
+  for (auto& t : transfers) in_order.push_back(t.get());
+  IconFetcher().run(in_order);
+
+  int result = 0;
   for (auto& [item, transfer] : pending) {
     if (!transfer->ok) {
       SDS_LOGE("[CRITICAL]  Failed to Download the Icon");

@@ -253,6 +253,75 @@ TEST_F(DbRows, ColumnReplaceRefusals) {
   EXPECT_EQ(db_.rows("SELECT * FROM site_deck"), before);
 }
 
+TEST_F(DbRows, SeveralColumnsInOneUpdateEndAsSingleWritesWould) {
+  ASSERT_TRUE(db_.exec("INSERT INTO site_deck(id, url) VALUES (2, 'https://a.example/')"));
+  int small = -1;
+  int64_t big = 5000000000;
+  const unsigned char blob[3] = {9, 0, 9};
+  const sds_db_column_value values[] = {
+      {"is_dirty", &small, 0, SDS_DB_COLUMN_TYPE_INT},
+      {"sync1", &big, 0, SDS_DB_COLUMN_TYPE_INT64},
+      {"title", "T", 99, SDS_DB_COLUMN_TYPE_TEXT},
+      {"icon_data", blob, 3, SDS_DB_COLUMN_TYPE_BLOB},
+      {"title", "Later", 0, SDS_DB_COLUMN_TYPE_TEXT},
+  };
+  int code = -5;
+  for (const sds_db_column_value& v : values) {
+    ASSERT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", v.column, v.value, v.length,
+                                    v.value_type, &code),
+              0);
+  }
+  LogCapture log;
+  EXPECT_EQ(sds_db_columns_replace(sds_db_handle, 2, "site_deck", values, 5, &code), 0);
+  EXPECT_EQ(code, SDS_ERROR_NONE);
+  EXPECT_EQ(log.count("Before write finalize, sqlite response code 101"), 1);
+  const std::string columns = "is_dirty, sync1, title, hex(icon_data), icon_size, order_index";
+  EXPECT_EQ(db_.rows("SELECT " + columns + " FROM site_deck WHERE id = 2"),
+            "-1|5000000000|Later|090009|NULL|0");
+  EXPECT_EQ(db_.rows("SELECT " + columns + " FROM site_deck WHERE id = 1"),
+            "-1|5000000000|Later|090009|96x64|2.5");
+}
+
+TEST_F(DbRows, SeveralColumnsRefusedWriteNone) {
+  const std::string before = db_.rows("SELECT * FROM site_deck");
+  int value = 5;
+  struct Case {
+    const char* name;
+    int id;
+    sds_db_column_value second;
+    const char* message;
+  };
+  const Case cases[] = {
+      {"id 0", 0, {"title", "T", 0, SDS_DB_COLUMN_TYPE_TEXT}, "check id:0"},
+      {"null value",
+       1,
+       {"title", nullptr, 0, SDS_DB_COLUMN_TYPE_TEXT},
+       "check materials for query id:1"},
+      {"null column",
+       1,
+       {nullptr, "T", 0, SDS_DB_COLUMN_TYPE_TEXT},
+       "check materials for query id:1"},
+      {"unknown type", 1, {"title", "T", 0, 9}, "invalid type:9"},
+      {"negative blob length",
+       1,
+       {"icon_data", "T", -1, SDS_DB_COLUMN_TYPE_BLOB},
+       "check materials for query id:1"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    const sds_db_column_value values[] = {{"is_dirty", &value, 0, SDS_DB_COLUMN_TYPE_INT},
+                                          c.second};
+    LogCapture log;
+    int code = -5;
+    EXPECT_EQ(sds_db_columns_replace(sds_db_handle, c.id, "site_deck", values, 2, &code), -1);
+    EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+    EXPECT_TRUE(log.contains(c.message));
+    EXPECT_EQ(db_.rows("SELECT * FROM site_deck"), before);
+  }
+  int code = -5;
+  EXPECT_EQ(sds_db_columns_replace(sds_db_handle, 1, "site_deck", nullptr, 0, &code), -1);
+}
+
 TEST_F(DbRows, DeleteOfUrlWithQuoteDeletesExactlyThatRow) {
   ASSERT_TRUE(db_.exec(
       "INSERT INTO site_deck(url) VALUES ('https://q.example/a''b'), ('https://q.example/a'), "

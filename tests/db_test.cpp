@@ -53,6 +53,75 @@ TEST(DbOpen, FirstStartCreatesTheTableWithAllColumnsAndDefaults) {
   EXPECT_FALSE(log.contains("errorcode : 0"));
 }
 
+// Merges look every listed site up by URL: without an index each lookup read
+// the whole table, so a merge took time quadratic in the list's length.
+TEST(DbOpen, UrlLookupsScannedTheWholeTable) {
+  DbSession db;
+  EXPECT_EQ(db.rows("SELECT name, tbl_name, sql FROM sqlite_master WHERE type = 'index' AND "
+                    "name NOT LIKE 'sqlite_autoindex%'"),
+            "site_deck_url_index|site_deck|CREATE INDEX site_deck_url_index ON site_deck(url)");
+  EXPECT_NE(db.rows("EXPLAIN QUERY PLAN SELECT id FROM site_deck WHERE url IS 'u'")
+                .find("SEARCH site_deck USING COVERING INDEX site_deck_url_index (url=?)"),
+            std::string::npos);
+}
+
+TEST(DbOpen, FileMadeBeforeTheUrlIndexGetsItAndKeepsItsRows) {
+  DbSession db(false);
+  sqlite3* other = nullptr;
+  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &other), SQLITE_OK);
+  ASSERT_EQ(
+      sqlite3_exec(other,
+                   (std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')").c_str(),
+                   nullptr, nullptr, nullptr),
+      SQLITE_OK);
+  sqlite3_close(other);
+
+  LogCapture log;
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_EQ(db.rows("SELECT name FROM sqlite_master WHERE name = 'site_deck_url_index'"),
+            "site_deck_url_index");
+  EXPECT_EQ(db.rows("SELECT sql FROM sqlite_master WHERE name='site_deck'"), kTableSql);
+  EXPECT_EQ(db.rows("SELECT url FROM site_deck"), "u");
+  EXPECT_TRUE(log.lines().empty());
+
+  // Opening it again finds the index there and changes nothing.
+  DbSession::close_handle();
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_EQ(db.rows("SELECT count(*) FROM sqlite_master WHERE name = 'site_deck_url_index'"), "1");
+}
+
+int count_commit(void* commits) {
+  ++*static_cast<int*>(commits);
+  return 0;
+}
+
+TEST(DbOpen, TableAndUrlIndexAreMadeInOneTransaction) {
+  DbSession db(false);
+  sqlite3* handle = nullptr;
+  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &handle), SQLITE_OK);
+  int commits = 0;
+  sqlite3_commit_hook(handle, count_commit, &commits);
+  EXPECT_EQ(__rebuild_site_deck_tables(handle), 0);
+  EXPECT_EQ(commits, 1);
+  EXPECT_NE(sqlite3_get_autocommit(handle), 0);
+  sqlite3_close(handle);
+  EXPECT_EQ(rows_of_file(db.db_path(), "SELECT type, name FROM sqlite_master ORDER BY name"),
+            "table|site_deck\nindex|site_deck_url_index\nindex|sqlite_autoindex_site_deck_1");
+}
+
+TEST(DbOpen, TableThatCannotBeMadeLeavesNoTransactionOpen) {
+  DbSession db(false);
+  ASSERT_TRUE(write_file(db.db_path(), ""));
+  sqlite3* handle = nullptr;
+  ASSERT_EQ(sqlite3_open_v2(db.db_path().c_str(), &handle, SQLITE_OPEN_READONLY, nullptr),
+            SQLITE_OK);
+  LogCapture log;
+  EXPECT_EQ(__rebuild_site_deck_tables(handle), -1);
+  EXPECT_TRUE(log.contains("create tables:8 error:attempt to write a readonly database"));
+  EXPECT_NE(sqlite3_get_autocommit(handle), 0);
+  sqlite3_close(handle);
+}
+
 TEST(DbOpen, FileThatIsNoDatabaseIsReplacedByAnEmptyTable) {
   DbSession db(false);
   ASSERT_TRUE(write_file(db.db_path(), std::string(4096, 'g') + "garbage, not a database"));

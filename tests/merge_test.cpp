@@ -11,6 +11,7 @@
 #include <string>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "sitedeck-service-raii.h"
 #include "sitedeck-service-request-server.h"
 #include "sitedeck-service-utils.h"
 #include "support/db_session.h"
@@ -151,6 +152,73 @@ TEST_F(Merge, StoresDownloadedIconsAndKeepsStoredOnes) {
   EXPECT_EQ(db_.rows("SELECT icon_size, icon_path, image_last_updated, length(icon_data) FROM "
                      "site_deck"),
             "2x2|https://a.example/i.png|t1|16");
+}
+
+// The merge writes each item's columns in one UPDATE; the single-column
+// accessors, one after another, must leave exactly the same rows.
+TEST_F(Merge, ItemsWrittenInOneUpdateEndAsWithTheSingleColumnWrites) {
+  const std::string dump = "SELECT * FROM site_deck ORDER BY url";
+  const std::string seed =
+      "DELETE FROM site_deck; INSERT INTO site_deck(id, url, title, dominant_color, icon_size, "
+      "icon_path, image_last_updated, icon_data, order_index) VALUES (5, 'https://a.example/', "
+      "'A0', '#AAAAAA', '4x4', 'https://a.example/old.png', 'old', x'00', 9)";
+  // A: stored, refreshed with a new icon whose size text is wrong, no colour
+  // and no time stamp. B: new, with an icon, specially removed. C: new, no icon.
+  auto build_list = [] {
+    sds_item* a = add_item(kA, "A1");
+    add_icon(a, "https://a.example/new.png", "9x9", "");
+    sds_item* b = add_item(kB, nullptr, "#BBBBBB", 1);
+    add_icon(b, "https://b.example/i.png", "3x2", "tb");
+    add_item(kC, "C", "#CCCCCC");
+  };
+  auto write_icons = [] {
+    for (const char* url : {"https://a.example/new.png", "https://b.example/i.png"}) {
+      UniqueCStr path(get_icon_path(url));
+      bool a = std::strcmp(url, "https://a.example/new.png") == 0;
+      if (!path || !png_write_file(path.get(), png_pattern(a ? 2 : 3, 2, a ? 2 : 6, 8))) {
+        return false;
+      }
+    }
+    return true;
+  };
+
+  ASSERT_TRUE(db_.exec(seed));
+  build_list();
+  ASSERT_TRUE(write_icons());
+  ASSERT_EQ(merge(), 0);
+  const std::string merged = db_.rows(dump);
+
+  ASSERT_TRUE(db_.exec(seed));
+  build_list();
+  ASSERT_TRUE(write_icons());
+  int order = 1;
+  for (sds_item* item = sds_item_list_head; item != nullptr; item = item->next, ++order) {
+    if (item->site_name == nullptr) item->site_name = strdup(item->site_url);
+    int code = 0;
+    int id =
+        sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
+    const bool stored = id >= 0;
+    if (!stored) id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
+    if (item->ps_sds_icon_list != nullptr) {
+      EXPECT_EQ(update_sitedeck_icon_to_db(id, item), SDS_ERROR_NONE);
+    }
+    EXPECT_EQ(update_sitedeck_order_index_to_db(id, &order), 0);
+    if (stored) {
+      EXPECT_EQ(update_sitedeck_title_to_db(id, item->site_name), 0);
+      if (item->predominant_color != nullptr) {
+        EXPECT_EQ(update_sitedeck_predominant_color_to_db(id, item->predominant_color), 0);
+      }
+    }
+    EXPECT_EQ(update_sitedeck_is_specially_removed(id, item->is_specially_removed), 0);
+  }
+  sds_free_item_list();
+  EXPECT_EQ(db_.rows(dump), merged);
+  EXPECT_EQ(merged,
+            "5|https://a.example/|A1|0|#AAAAAA|0|NULL|1|old|2x2|https://a.example/new.png|blob:16|"
+            "1|NULL|NULL|NULL|NULL\n"
+            "6|https://b.example/|https://b.example/|0|#BBBBBB|1|NULL|-1|tb|3x2|"
+            "https://b.example/i.png|blob:24|2|NULL|NULL|NULL|NULL\n"
+            "7|https://c.example/|C|0|#CCCCCC|0|NULL|1||||NULL|3|NULL|NULL|NULL|NULL");
 }
 
 TEST_F(Merge, EmptyListIsRefusedInsteadOfDeletingEverySite) {

@@ -18,7 +18,13 @@ std::string fixed(double value, int decimals) {
   return buffer;
 }
 
-std::string micros(int64_t ns) { return fixed(static_cast<double>(ns) / 1000.0, 1); }
+// A time in the unit that keeps it readable, or a byte count in MiB.
+std::string amount(const bench_result& r, int64_t value) {
+  auto v = static_cast<double>(value);
+  if (r.bytes) return fixed(v / (1024.0 * 1024.0), 1) + " MiB";
+  if (value >= 10'000'000) return fixed(v / 1e6, 1) + " ms";
+  return fixed(v / 1000.0, 1) + " µs";
+}
 
 std::string json_escape(const std::string& text) {
   std::string out;
@@ -34,6 +40,7 @@ std::string json_escape(const std::string& text) {
 // case can; `elapsed_ns` gets the time of the try that succeeded.
 bool run_once(const bench_case& c, bench_result* result, int64_t* elapsed_ns) {
   for (int attempt = 1; attempt <= kTriesPerIteration; ++attempt) {
+    if (c.prepare && !c.prepare()) return false;
     auto start = std::chrono::steady_clock::now();
     bool ok = c.body();
     auto end = std::chrono::steady_clock::now();
@@ -60,6 +67,8 @@ std::vector<bench_result> bench_time_cases(const std::string& group,
     results[c].name = cases[c].name;
     results[c].description = cases[c].description;
     results[c].floor = cases[c].floor;
+    results[c].floor_scale = cases[c].floor_scale;
+    results[c].target = cases[c].target;
     results[c].samples_ns.reserve(static_cast<size_t>(iterations));
     for (int i = 0; i < warmup && !results[c].failed; ++i) {
       if (!run_once(cases[c], &results[c], nullptr)) {
@@ -114,34 +123,54 @@ const bench_result* bench_report::find(const std::string& name) const {
   return nullptr;
 }
 
+bench_report::bench_summary bench_report::summarise(const bench_result& r) const {
+  bench_summary s;
+  s.median = bench_quantile(r.samples_ns, 0.5);
+  s.p99 = bench_quantile(r.samples_ns, 0.99);
+  s.floor = r.floor.empty() ? nullptr : find(r.floor);
+  if (s.floor != nullptr) {
+    double scale = r.floor_scale > 0 ? r.floor_scale : 1.0;
+    double floor_median = static_cast<double>(bench_quantile(s.floor->samples_ns, 0.5)) * scale;
+    double floor_p99 = static_cast<double>(bench_quantile(s.floor->samples_ns, 0.99)) * scale;
+    if (floor_median > 0) s.ratio_median = static_cast<double>(s.median) / floor_median;
+    if (floor_p99 > 0) s.ratio_p99 = static_cast<double>(s.p99) / floor_p99;
+  }
+  if (r.target > 0) {
+    double measured = s.floor != nullptr ? s.ratio_median : static_cast<double>(s.median);
+    s.target_met = measured > 0 && measured <= r.target;
+  }
+  return s;
+}
+
 bool bench_report::any_failed() const {
   return std::any_of(results_.begin(), results_.end(), [](const auto& r) { return r.failed; });
 }
 
 std::string bench_report::markdown() const {
   std::string out =
-      "| scenario | iterations | median µs | p99 µs | floor | ratio median | ratio p99 |\n"
-      "|---|---:|---:|---:|---|---:|---:|\n";
+      "| scenario | iterations | median | p99 | floor | ratio median | ratio p99 | target |\n"
+      "|---|---:|---:|---:|---|---:|---:|---:|\n";
   for (const auto& r : results_) {
     std::string name = r.group + "/" + r.name;
     if (r.failed) {
-      out += "| " + name + " | failed: " + r.failure + " | | | | | |\n";
+      out += "| " + name + " | failed: " + r.failure + " | | | | | | |\n";
       continue;
     }
-    int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
-    std::string floor_cell = "—", ratio_median = "—", ratio_p99 = "—";
-    if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
-      int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
-      int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
-      floor_cell = f->name;
-      if (floor_median > 0) {
-        ratio_median = fixed(static_cast<double>(median) / floor_median, 2);
-      }
-      if (floor_p99 > 0) ratio_p99 = fixed(static_cast<double>(p99) / floor_p99, 2);
+    const bench_summary s = summarise(r);
+    std::string floor_cell = "—", ratio_median = "—", ratio_p99 = "—", target = "—";
+    if (s.floor != nullptr) {
+      floor_cell = s.floor->name;
+      if (r.floor_scale != 1.0) floor_cell += " × " + fixed(r.floor_scale, 0);
+      if (s.ratio_median > 0) ratio_median = fixed(s.ratio_median, 2);
+      if (s.ratio_p99 > 0) ratio_p99 = fixed(s.ratio_p99, 2);
     }
-    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " + micros(median) +
-           " | " + micros(p99) + " | " + floor_cell + " | " + ratio_median + " | " + ratio_p99 +
-           " |\n";
+    if (r.target > 0) {
+      target = "≤ " + (r.bytes ? amount(r, static_cast<int64_t>(r.target)) : fixed(r.target, 2)) +
+               (s.target_met ? " ✓" : " ✗");
+    }
+    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " + amount(r, s.median) +
+           " | " + amount(r, s.p99) + " | " + floor_cell + " | " + ratio_median + " | " +
+           ratio_p99 + " | " + target + " |\n";
   }
   for (const auto& r : results_) {
     if (r.repeated > 0) {
@@ -149,6 +178,7 @@ std::string bench_report::markdown() const {
              " iteration(s) repeated after a recovery (another process disturbed the run)\n";
     }
   }
+  for (const auto& n : notes_) out += "\n" + n + "\n";
   return out;
 }
 
@@ -168,22 +198,31 @@ std::string bench_report::json(const std::string& mode) const {
       out += ", \"failed\": \"" + json_escape(r.failure) + "\"}";
       continue;
     }
-    int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
-    out += ", \"iterations\": " + std::to_string(r.samples_ns.size()) +
-           ", \"median_ns\": " + std::to_string(median) + ", \"p99_ns\": " + std::to_string(p99) +
+    const bench_summary s = summarise(r);
+    out += ", \"unit\": \"" + std::string(r.bytes ? "bytes" : "ns") +
+           "\", \"iterations\": " + std::to_string(r.samples_ns.size()) +
+           ", \"median_ns\": " + std::to_string(s.median) +
+           ", \"p99_ns\": " + std::to_string(s.p99) +
            ", \"min_ns\": " + std::to_string(bench_quantile(r.samples_ns, 0.0)) +
            ", \"repeated\": " + std::to_string(r.repeated);
-    if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
-      int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
-      int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
-      out += ", \"floor\": \"" + json_escape(f->name) + "\"";
-      if (floor_median > 0 && floor_p99 > 0) {
-        out += ", \"ratio_median\": " + fixed(static_cast<double>(median) / floor_median, 3) +
-               ", \"ratio_p99\": " + fixed(static_cast<double>(p99) / floor_p99, 3);
+    if (s.floor != nullptr) {
+      out += ", \"floor\": \"" + json_escape(s.floor->name) + "\"";
+      if (r.floor_scale != 1.0) out += ", \"floor_scale\": " + fixed(r.floor_scale, 3);
+      if (s.ratio_median > 0 && s.ratio_p99 > 0) {
+        out += ", \"ratio_median\": " + fixed(s.ratio_median, 3) +
+               ", \"ratio_p99\": " + fixed(s.ratio_p99, 3);
       }
+    }
+    if (r.target > 0) {
+      out += ", \"target\": " + fixed(r.target, 3) +
+             ", \"target_met\": " + (s.target_met ? "true" : "false");
     }
     out += "}";
   }
-  out += "\n  ]\n}\n";
+  out += "\n  ],\n  \"notes\": [";
+  for (size_t i = 0; i < notes_.size(); ++i) {
+    out += (i == 0 ? "\"" : ", \"") + json_escape(notes_[i]) + "\"";
+  }
+  out += "]\n}\n";
   return out;
 }

@@ -23,6 +23,13 @@ struct bench_result {
   std::string name;
   std::string description;
   std::string floor;
+  // The ratio to the floor is taken against floor x floor_scale: a pull of
+  // 5000 items beside the pull of 50 compares the time per item.
+  double floor_scale = 1.0;
+  // The goal: the median ratio to the floor (or, for a byte count with no
+  // floor, the median itself) must not exceed it. 0: none.
+  double target = 0.0;
+  bool bytes = false;               // samples are byte counts, not times
   std::vector<int64_t> samples_ns;  // one per timed iteration
   int repeated = 0;                 // iterations redone after a recovery
   bool failed = false;              // an iteration's body reported failure
@@ -41,6 +48,11 @@ struct bench_case {
   std::string floor;
   std::function<bool()> body;
   std::function<bool()> recover = {};
+  // Runs untimed before every try of an iteration (a fresh start state, say);
+  // false fails the iteration.
+  std::function<bool()> prepare = {};
+  double floor_scale = 1.0;  // as in bench_result
+  double target = 0.0;       // as in bench_result
 };
 
 // Runs every case `warmup` times untimed, then `iterations` times timed, the
@@ -58,6 +70,9 @@ int64_t bench_quantile(const std::vector<int64_t>& samples_ns, double q);
 class bench_report {
  public:
   void add(bench_result result);
+  // A line printed under the table (and listed in the JSON): a condition of
+  // the run that its numbers depend on.
+  void note(std::string text) { notes_.push_back(std::move(text)); }
   // Scenario's iteration count: `full`, or `quick` in a quick run.
   static int iterations(const bench_options& options, int full, int quick);
   // The Markdown table for people.
@@ -67,8 +82,18 @@ class bench_report {
   bool any_failed() const;
 
  private:
+  struct bench_summary {
+    int64_t median = 0;
+    int64_t p99 = 0;
+    const bench_result* floor = nullptr;
+    double ratio_median = 0;  // 0 when there is no floor
+    double ratio_p99 = 0;
+    bool target_met = false;
+  };
   const bench_result* find(const std::string& name) const;
+  bench_summary summarise(const bench_result& r) const;
   std::vector<bench_result> results_;
+  std::vector<std::string> notes_;
 };
 
 // A scenario group: measures its scenarios and adds them to the report.

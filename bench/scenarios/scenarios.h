@@ -9,3 +9,6 @@
 bool bench_group_queries(const bench_options& options, bench_report* report);
 // The 24-tile deck, on an open connection and on a fresh one.
 bool bench_group_deck(const bench_options& options, bench_report* report);
+// Data pulls of 50 items beside a one-process floor, with and without
+// server latency; 500 and 5000 items per item; peak memory.
+bool bench_group_pull(const bench_options& options, bench_report* report);

@@ -47,15 +47,8 @@ bool parse_icon_size(const char* text, int* width, int* height) {
   return true;
 }
 
-// Writes one icon column; the code replaces `code` and is logged if not 0.
-void write_icon_column(int id, const char* column, const void* value, int length, int type,
-                       int* code) {
-  (void)sds_db_column_replace(sds_db_handle, id, kSiteDeck, column, value, length, type, code);
-  if (*code != SDS_ERROR_NONE) SDS_LOGE("Error : %s", sds_error_string(*code));
-}
-
-// Reads, decodes and stores the icon file at `path`; returns the code.
-int store_icon_file(int id, const sds_icon* icon, const char* path) {
+// Reads and decodes the icon file at `path` into `out`; returns the code.
+int load_icon_file(const sds_icon* icon, const char* path, sds_icon_columns* out) {
   UniqueFile file(std::fopen(path, "rb"));
   if (!file) {
     SDS_LOGE("Failed to open file");
@@ -91,34 +84,26 @@ int store_icon_file(int id, const sds_icon* icon, const char* path) {
     SDS_LOGE("some error occured while converting data");
     return SDS_ERROR_IO_ERROR;
   }
-  UniqueMalloc<unsigned char> pixels(raw_pixels);
+  out->pixels.reset(raw_pixels);
+  out->pixel_bytes = size;
+  out->icon_path = icon->icon_path;
 
   // The server's size text is kept when it describes the decoded pixels;
   // otherwise (empty, or a different size) the decoded size replaces it.
-  char size_text[sizeof icon->icon_size + 1] = {};
-  std::memcpy(size_text, icon->icon_size, sizeof icon->icon_size);
+  std::memset(out->icon_size, 0, sizeof out->icon_size);
+  std::memcpy(out->icon_size, icon->icon_size, sizeof icon->icon_size);
   int text_width = 0;
   int text_height = 0;
-  if (!parse_icon_size(size_text, &text_width, &text_height) || text_width != width ||
+  if (!parse_icon_size(out->icon_size, &text_width, &text_height) || text_width != width ||
       text_height != height) {
     char decoded[32];
     (void)std::snprintf(decoded, sizeof decoded, "%dx%d", width, height);
-    std::memcpy(size_text, decoded, sizeof size_text - 1);
-    size_text[sizeof size_text - 1] = '\0';
+    std::memcpy(out->icon_size, decoded, sizeof out->icon_size - 1);
+    out->icon_size[sizeof out->icon_size - 1] = '\0';
   }
-  char last_modified[sizeof icon->last_modified + 1] = {};
-  std::memcpy(last_modified, icon->last_modified, sizeof icon->last_modified);
-
-  int code = SDS_ERROR_NONE;
-  write_icon_column(id, "icon_data", pixels.get(), size, SDS_DB_COLUMN_TYPE_BLOB, &code);
-  if (icon->icon_path != nullptr) {
-    write_icon_column(id, "icon_path", icon->icon_path, 0, SDS_DB_COLUMN_TYPE_TEXT, &code);
-  }
-  write_icon_column(id, "icon_size", size_text, 0, SDS_DB_COLUMN_TYPE_TEXT, &code);
-  if (last_modified[0] != '\0') {
-    write_icon_column(id, "image_last_updated", last_modified, 0, SDS_DB_COLUMN_TYPE_TEXT, &code);
-  }
-  return code;
+  std::memset(out->last_modified, 0, sizeof out->last_modified);
+  std::memcpy(out->last_modified, icon->last_modified, sizeof icon->last_modified);
+  return SDS_ERROR_NONE;
 }
 
 }  // namespace
@@ -159,9 +144,9 @@ int sds_get_blob_from_db(int id, int* length, int* height, int* width, unsigned 
 
 namespace {
 
-// Checks the item and stores its one icon from the icon file; the path of
+// Checks the item and loads its one icon from the icon file; the path of
 // that file goes to `*path` (null when there is none) for the caller to remove.
-int store_item_icon(int id, const sds_item* item, UniqueCStr* path) {
+int load_item_icon(const sds_item* item, sds_icon_columns* out, UniqueCStr* path) {
   if (item == nullptr) {
     SDS_LOGE("NULL check::item");
     return SDS_ERROR_INVALID_PARAMETER;
@@ -180,19 +165,45 @@ int store_item_icon(int id, const sds_item* item, UniqueCStr* path) {
     SDS_LOGE("NULL check::icon_path");
     return SDS_ERROR_INVALID_PARAMETER;
   }
-  return store_icon_file(id, icon, path->get());
+  return load_icon_file(icon, path->get(), out);
+}
+
+// Writes one icon column; the code replaces `code` and is logged if not 0.
+void write_icon_column(int id, const sds_db_column_value& value, int* code) {
+  (void)sds_db_column_replace(sds_db_handle, id, kSiteDeck, value.column, value.value, value.length,
+                              value.value_type, code);
+  if (*code != SDS_ERROR_NONE) SDS_LOGE("Error : %s", sds_error_string(*code));
 }
 
 }  // namespace
 
+int sds_icon_columns_values(const sds_icon_columns& icon, sds_db_column_value* values) {
+  int count = 0;
+  values[count++] = {"icon_data", icon.pixels.get(), icon.pixel_bytes, SDS_DB_COLUMN_TYPE_BLOB};
+  if (icon.icon_path != nullptr) {
+    values[count++] = {"icon_path", icon.icon_path, 0, SDS_DB_COLUMN_TYPE_TEXT};
+  }
+  values[count++] = {"icon_size", icon.icon_size, 0, SDS_DB_COLUMN_TYPE_TEXT};
+  if (icon.last_modified[0] != '\0') {
+    values[count++] = {"image_last_updated", icon.last_modified, 0, SDS_DB_COLUMN_TYPE_TEXT};
+  }
+  return count;
+}
+
 int update_sitedeck_icon_to_db(int id, sds_item* item) {
   UniqueCStr path;
-  int code = store_item_icon(id, item, &path);
+  sds_icon_columns icon;
+  int code = load_item_icon(item, &icon, &path);
+  if (code == SDS_ERROR_NONE) {
+    sds_db_column_value values[SDS_ICON_COLUMNS_MAX];
+    int count = sds_icon_columns_values(icon, values);
+    for (int i = 0; i < count; ++i) write_icon_column(id, values[i], &code);
+  }
   if (path) (void)remove_file(path.get());
   return code;
 }
 
-int sds_store_sitedeck_icon_keep_file(int id, const sds_item* item) {
+int sds_load_sitedeck_icon_columns(const sds_item* item, sds_icon_columns* out) {
   UniqueCStr path;
-  return store_item_icon(id, item, &path);
+  return load_item_icon(item, out, &path);
 }

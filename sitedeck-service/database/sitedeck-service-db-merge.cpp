@@ -15,6 +15,7 @@
 #include <unordered_set>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db-stmt-cache.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
@@ -31,6 +32,10 @@ bool run(const char* sql) {
 }
 
 // Pass 1 for one item: insert or refresh its row. `order` is its number.
+// The columns that the single-column accessors would write one after
+// another (the icon's four, the order number, the title, the colour and the
+// specially removed state) go into one UPDATE per item: inside the merge's
+// transaction the row ends the same, with a third of the statements.
 // False when a write of the row itself failed (a read-only or full disk, an
 // I/O error): the table would then not hold the list. A failed icon store
 // is not counted: a broken icon leaves its site without an icon.
@@ -42,21 +47,33 @@ bool merge_item(sds_item* item, int order) {
   int code = SDS_ERROR_NONE;
   bool written = true;
   int id = sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
-  if (id < 0) {
+  const bool stored = id >= 0;
+  if (!stored) {
     id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
     written = id > 0;
-    (void)sds_store_sitedeck_icon_keep_file(id, item);
-    written = update_sitedeck_order_index_to_db(id, &order) == 0 && written;
-    written = update_sitedeck_is_specially_removed(id, item->is_specially_removed) == 0 && written;
-  } else {
-    (void)sds_store_sitedeck_icon_keep_file(id, item);
-    written = update_sitedeck_order_index_to_db(id, &order) == 0 && written;
-    written = update_sitedeck_title_to_db(id, item->site_name) == 0 && written;
-    if (item->predominant_color != nullptr) {
-      written =
-          update_sitedeck_predominant_color_to_db(id, item->predominant_color) == 0 && written;
+  }
+
+  sds_icon_columns icon;
+  sds_db_column_value values[SDS_ICON_COLUMNS_MAX + 4];
+  int count = 0;
+  if (sds_load_sitedeck_icon_columns(item, &icon) == SDS_ERROR_NONE) {
+    count = sds_icon_columns_values(icon, values);
+  }
+  values[count++] = {"order_index", &order, 0, SDS_DB_COLUMN_TYPE_INT};
+  if (stored) {
+    if (item->site_name != nullptr) {
+      values[count++] = {"title", item->site_name, 0, SDS_DB_COLUMN_TYPE_TEXT};
     }
-    written = update_sitedeck_is_specially_removed(id, item->is_specially_removed) == 0 && written;
+    if (item->predominant_color != nullptr) {
+      values[count++] = {"dominant_color", item->predominant_color, 0, SDS_DB_COLUMN_TYPE_TEXT};
+    }
+  }
+  int is_dirty = item->is_specially_removed != 0 ? -1 : 1;
+  values[count++] = {"is_dirty", &is_dirty, 0, SDS_DB_COLUMN_TYPE_INT};
+  int write_code = SDS_ERROR_NONE;
+  if (sds_db_columns_replace(sds_db_handle, id, "site_deck", values, count, &write_code) != 0) {
+    SDS_LOGE("Error : %s", sds_error_string(write_code));
+    written = false;
   }
   if (code != SDS_ERROR_NONE) SDS_LOGE("Error :: %s", sds_error_string(code));
   return written;
@@ -136,6 +153,8 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   }
   IconFileSweep sweep{head};
   if (!run("BEGIN IMMEDIATE")) return SDS_MERGE_NOT_COMMITTED;
+  // Every item runs the same few statements: prepare each once.
+  SdsDbStatementScope statements(sds_db_handle);
 
   int order = 1;
   bool rows_written = true;

@@ -4,7 +4,8 @@
 // Table and column names are constants of the service and are formatted into
 // the SQL text; every value is bound, except the URL of a delete, which is
 // quoted as one SQL string literal. Each call prepares, runs and finalizes its
-// own statements; nothing outlives it but the outputs it hands out.
+// own statements (or, inside an SdsDbStatementScope, reuses kept ones);
+// nothing outlives it but the outputs it hands out.
 #include <sqlite3.h>
 
 #include <cstdlib>
@@ -65,6 +66,10 @@ bool sds_db_prepare(sqlite3* handle, char* sql, SqliteStmt* stmt, int* error_cod
     SDS_LOGE("check available memory");
     return false;
   }
+  if (sqlite3_stmt* kept = sds_db_stmt_cache_take(handle, text.get())) {
+    stmt->reset(kept);
+    return true;
+  }
   sqlite3_stmt* raw = nullptr;
   int rc = sqlite3_prepare_v2(handle, text.get(), -1, &raw, nullptr);
   stmt->reset(raw);
@@ -73,6 +78,7 @@ bool sds_db_prepare(sqlite3* handle, char* sql, SqliteStmt* stmt, int* error_cod
     *error_code = sds_db_reason_or(handle, SDS_ERROR_INVALID_PARAMETER);
     return false;
   }
+  (void)sds_db_stmt_cache_keep(handle, text.get(), raw);
   return true;
 }
 
@@ -252,6 +258,12 @@ int sds_db_create_site_deck_item(sqlite3* handle, const sds_item* item, int* err
 
 int sds_db_column_replace(sqlite3* handle, int id, const char* table, const char* column,
                           const void* value, int length, int value_type, int* error_code) {
+  sds_db_column_value one{column, value, length, value_type};
+  return sds_db_columns_replace(handle, id, table, &one, 1, error_code);
+}
+
+int sds_db_columns_replace(sqlite3* handle, int id, const char* table,
+                           const sds_db_column_value* values, int count, int* error_code) {
   *error_code = SDS_ERROR_INVALID_PARAMETER;
   if (handle == nullptr) {
     SDS_LOGE("check connection handle");
@@ -261,42 +273,57 @@ int sds_db_column_replace(sqlite3* handle, int id, const char* table, const char
     SDS_LOGE("check id:%d", id);
     return -1;
   }
-  if (table == nullptr || column == nullptr || value == nullptr) {
+  bool complete = table != nullptr && values != nullptr && count > 0;
+  for (int i = 0; complete && i < count; ++i) {
+    complete = values[i].column != nullptr && values[i].value != nullptr;
+  }
+  if (!complete) {
     SDS_LOGE("check materials for query id:%d", id);
     return -1;
   }
+  // "c1 = ?,c2 = ?": the names are constants of the service, as above.
+  SqliteText assignments(sqlite3_mprintf("%s = ?", values[0].column));
+  for (int i = 1; i < count && assignments; ++i) {
+    assignments.reset(sqlite3_mprintf("%s,%s = ?", assignments.get(), values[i].column));
+  }
+  if (!assignments) {
+    SDS_LOGE("check available memory");
+    return -1;
+  }
   SqliteStmt stmt;
-  if (!sds_db_prepare(handle,
-                      sqlite3_mprintf("UPDATE %s SET %s = ? WHERE %s IS ?", table, column, "id"),
-                      &stmt, error_code)) {
+  if (!sds_db_prepare(
+          handle, sqlite3_mprintf("UPDATE %s SET %s WHERE %s IS ?", table, assignments.get(), "id"),
+          &stmt, error_code)) {
     return -1;
   }
-  int rc = SQLITE_OK;
-  switch (value_type) {
-    case SDS_DB_COLUMN_TYPE_INT:
-      rc = sqlite3_bind_int(stmt.get(), 1, *static_cast<const int*>(value));
-      break;
-    case SDS_DB_COLUMN_TYPE_INT64:
-      rc = sqlite3_bind_int64(stmt.get(), 1, *static_cast<const int64_t*>(value));
-      break;
-    case SDS_DB_COLUMN_TYPE_TEXT:
-      rc = sqlite3_bind_text(stmt.get(), 1, static_cast<const char*>(value), -1, SQLITE_STATIC);
-      break;
-    case SDS_DB_COLUMN_TYPE_BLOB:
-      if (length < 0) {
-        SDS_LOGE("check materials for query id:%d", id);
+  for (int i = 0; i < count; ++i) {
+    const sds_db_column_value& v = values[i];
+    int rc = SQLITE_OK;
+    switch (v.value_type) {
+      case SDS_DB_COLUMN_TYPE_INT:
+        rc = sqlite3_bind_int(stmt.get(), i + 1, *static_cast<const int*>(v.value));
+        break;
+      case SDS_DB_COLUMN_TYPE_INT64:
+        rc = sqlite3_bind_int64(stmt.get(), i + 1, *static_cast<const int64_t*>(v.value));
+        break;
+      case SDS_DB_COLUMN_TYPE_TEXT:
+        rc = sqlite3_bind_text(stmt.get(), i + 1, static_cast<const char*>(v.value), -1,
+                               SQLITE_STATIC);
+        break;
+      case SDS_DB_COLUMN_TYPE_BLOB:
+        if (v.length < 0) {
+          SDS_LOGE("check materials for query id:%d", id);
+          return -1;
+        }
+        rc = sqlite3_bind_blob(stmt.get(), i + 1, v.value, v.length, SQLITE_STATIC);
+        break;
+      default:
+        SDS_LOGE("invalid type:%d", v.value_type);
         return -1;
-      }
-      rc = sqlite3_bind_blob(stmt.get(), 1, value, length, SQLITE_STATIC);
-      break;
-    default:
-      SDS_LOGE("invalid type:%d", value_type);
-      return -1;
+    }
+    if (!sds_db_bind_ok(handle, rc, error_code)) return -1;
   }
-  if (!sds_db_bind_ok(handle, rc, error_code) ||
-      !sds_db_bind_ok(handle, sqlite3_bind_int(stmt.get(), 2, id), error_code)) {
-    return -1;
-  }
+  if (!sds_db_bind_ok(handle, sqlite3_bind_int(stmt.get(), count + 1, id), error_code)) return -1;
   *error_code = SDS_ERROR_NONE;
   return step_write(handle, stmt.get(), error_code) ? 0 : -1;
 }

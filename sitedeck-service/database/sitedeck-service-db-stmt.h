@@ -1,5 +1,6 @@
 // Owners for the SQLite objects the storage modules create: a prepared
-// statement (finalized through __db_finalize, so a failing finalize is logged)
+// statement (finalized through __db_finalize, so a failing finalize is logged,
+// or given back to the statement cache when it came from there)
 // and a statement text from sqlite3_mprintf, with the steps every operation
 // shares. Private to sitedeck-service/database.
 #pragma once
@@ -8,10 +9,13 @@
 
 #include <memory>
 
+#include "database/sitedeck-service-db-stmt-cache.h"
 #include "database/sitedeck-service-db.h"
 
 struct SqliteStmtFinalizer {
-  void operator()(sqlite3_stmt* stmt) const noexcept { __db_finalize(stmt); }
+  void operator()(sqlite3_stmt* stmt) const noexcept {
+    if (!sds_db_stmt_cache_give_back(stmt)) __db_finalize(stmt);
+  }
 };
 using SqliteStmt = std::unique_ptr<sqlite3_stmt, SqliteStmtFinalizer>;
 
@@ -23,7 +27,8 @@ using SqliteText = std::unique_ptr<char, SqliteTextFree>;
 // The connection's own reason for its last failure (sds_db_get_errorcode), or
 // `fallback` when it has none.
 int sds_db_reason_or(sqlite3* handle, int fallback);
-// Prepares `sql` (from sqlite3_mprintf, freed here) into `stmt`. On failure
+// Prepares `sql` (from sqlite3_mprintf, freed here) into `stmt`, or takes the
+// statement kept for it by an open SdsDbStatementScope. On failure
 // logs, sets `error_code` from the connection and returns false.
 bool sds_db_prepare(sqlite3* handle, char* sql, SqliteStmt* stmt, int* error_code);
 // Checks the result of a bind; on failure logs and sets `error_code`.

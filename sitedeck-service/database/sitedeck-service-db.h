@@ -2,7 +2,8 @@
 // one table `site_deck`, the mapping of SQLite results to SDS codes, and the
 // generic row and column operations every accessor is built on. Every
 // operation takes the connection first and reports a reason code through its
-// last argument; statements never outlive the call that prepared them.
+// last argument; statements never outlive the call that prepared them, except
+// inside an SdsDbStatementScope (sitedeck-service-db-stmt-cache.h).
 #pragma once
 
 #include <cstdint>
@@ -56,6 +57,21 @@ int sds_db_create_site_deck_id(sqlite3* handle, int* id, int* error_code);
 int sds_db_create_site_deck_item(sqlite3* handle, const sds_item* item, int* error_code);
 int sds_db_column_replace(sqlite3* handle, int id, const char* table, const char* column,
                           const void* value, int length, int value_type, int* error_code);
+
+// One column's new value for sds_db_columns_replace; `length` counts the
+// bytes of a blob and is ignored for the other types.
+struct sds_db_column_value {
+  const char* column = nullptr;
+  const void* value = nullptr;
+  int length = 0;
+  int value_type = SDS_DB_COLUMN_TYPE_INT;
+};
+// Writes several columns of row `id` in one UPDATE, with the checks and
+// messages of sds_db_column_replace; the row ends as if each column had been
+// written by sds_db_column_replace in turn and all of them had succeeded.
+// 0, or -1 with the reason in `error_code` and no column written.
+int sds_db_columns_replace(sqlite3* handle, int id, const char* table,
+                           const sds_db_column_value* values, int count, int* error_code);
 int sds_db_get_property_string(sqlite3* handle, int id, const char* table, const char* column,
                                char** value, int* error_code);
 int sds_db_get_property_blob(sqlite3* handle, int id, const char* table, const char* column,

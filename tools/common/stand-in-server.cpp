@@ -138,6 +138,13 @@ int standin_bind(httplib::Server& svr, const standin_listen_options& options, co
   termination_signals(&set);
   pthread_sigmask(SIG_BLOCK, &set, nullptr);
   signal(SIGPIPE, SIG_IGN);
+  // An answer goes out as a header write and a body write; with Nagle's
+  // algorithm the body waits for the client's delayed ACK of the header
+  // (tens of ms) on every request after the first of a kept-alive connection.
+  svr.set_tcp_nodelay(true);
+  // A kept-alive connection carries up to this many requests (as a web
+  // server's default would), not the library's default of five.
+  svr.set_keep_alive_max_count(1000);
 
   if (options.port == 0) {
     const int port = svr.bind_to_any_port("127.0.0.1");
