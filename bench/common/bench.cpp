@@ -34,19 +34,57 @@ std::string json_escape(const std::string& text) {
 // case can; `elapsed_ns` gets the time of the try that succeeded.
 bool run_once(const bench_case& c, bench_result* result, int64_t* elapsed_ns) {
   for (int attempt = 1; attempt <= kTriesPerIteration; ++attempt) {
-    auto start = std::chrono::steady_clock::now();
-    bool ok = c.body();
-    auto end = std::chrono::steady_clock::now();
+    int64_t elapsed = 0;
+    bool ok = false;
+    if (c.timed) {
+      ok = c.timed(&elapsed);
+    } else {
+      auto start = std::chrono::steady_clock::now();
+      ok = c.body();
+      auto end = std::chrono::steady_clock::now();
+      elapsed = std::chrono::duration_cast<std::chrono::nanoseconds>(end - start).count();
+    }
     if (ok) {
-      if (elapsed_ns != nullptr) {
-        *elapsed_ns = std::chrono::duration_cast<std::chrono::nanoseconds>(end - start).count();
-      }
+      if (elapsed_ns != nullptr) *elapsed_ns = elapsed;
       return true;
     }
     if (!c.recover || attempt == kTriesPerIteration || !c.recover()) return false;
     ++result->repeated;
   }
   return false;
+}
+
+// A sample as people read it: microseconds, or MiB for memory.
+std::string amount(int64_t value, bool memory) {
+  if (memory) return fixed(static_cast<double>(value) / (1024.0 * 1024.0), 2) + " MiB";
+  return micros(value) + " µs";
+}
+
+// How `value` stands to `floor_value`: a ratio, or the excess for memory.
+std::string relation(int64_t value, int64_t floor_value, bool memory) {
+  if (memory) {
+    double excess = static_cast<double>(value - floor_value) / (1024.0 * 1024.0);
+    std::string text = excess >= 0 ? "+" : "";
+    text += fixed(excess, 2);
+    text += " MiB";
+    return text;
+  }
+  return floor_value > 0 ? fixed(static_cast<double>(value) / floor_value, 2) : "—";
+}
+
+bool meets(const bench_target& target, int64_t value, int64_t floor_value, bool memory) {
+  if (memory) return target.excess_bytes > 0 && value - floor_value <= target.excess_bytes;
+  return target.ratio > 0 && floor_value > 0 &&
+         static_cast<double>(value) <= target.ratio * static_cast<double>(floor_value);
+}
+
+std::string target_text(const bench_target& target, bool memory) {
+  if (memory && target.excess_bytes > 0) {
+    return "≤ +" + fixed(static_cast<double>(target.excess_bytes) / (1024.0 * 1024.0), 0) +
+           " MiB";
+  }
+  if (!memory && target.ratio > 0) return "≤ " + fixed(target.ratio, 1);
+  return "";
 }
 
 }  // namespace
@@ -60,6 +98,7 @@ std::vector<bench_result> bench_time_cases(const std::string& group,
     results[c].name = cases[c].name;
     results[c].description = cases[c].description;
     results[c].floor = cases[c].floor;
+    results[c].target = cases[c].target;
     results[c].samples_ns.reserve(static_cast<size_t>(iterations));
     for (int i = 0; i < warmup && !results[c].failed; ++i) {
       if (!run_once(cases[c], &results[c], nullptr)) {
@@ -85,6 +124,10 @@ std::vector<bench_result> bench_time_cases(const std::string& group,
     }
   }
   return results;
+}
+
+std::string bench_scenario_name(const std::string& name, const bench_service& service) {
+  return service.label.empty() ? name : name + "@" + service.label;
 }
 
 int64_t bench_quantile(const std::vector<int64_t>& samples_ns, double q) {
@@ -120,28 +163,33 @@ bool bench_report::any_failed() const {
 
 std::string bench_report::markdown() const {
   std::string out =
-      "| scenario | iterations | median µs | p99 µs | floor | ratio median | ratio p99 |\n"
-      "|---|---:|---:|---:|---|---:|---:|\n";
+      "| scenario | iterations | median | p99 | floor | floor median | floor p99 | ratio median "
+      "| ratio p99 | target | met (median / p99) |\n"
+      "|---|---:|---:|---:|---|---:|---:|---:|---:|---|---|\n";
   for (const auto& r : results_) {
     std::string name = r.group + "/" + r.name;
     if (r.failed) {
-      out += "| " + name + " | failed: " + r.failure + " | | | | | |\n";
+      out += "| " + name + " | failed: " + r.failure + " | | | | | | | | | |\n";
       continue;
     }
     int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
-    std::string floor_cell = "—", ratio_median = "—", ratio_p99 = "—";
+    std::string floor_cells = "— | | ", ratio_cells = "— | —", target_cell, met_cell;
     if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
       int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
       int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
-      floor_cell = f->name;
-      if (floor_median > 0) {
-        ratio_median = fixed(static_cast<double>(median) / floor_median, 2);
+      floor_cells = f->name + " | " + amount(floor_median, r.memory) + " | " +
+                    amount(floor_p99, r.memory);
+      ratio_cells = relation(median, floor_median, r.memory) + " | " +
+                    relation(p99, floor_p99, r.memory);
+      target_cell = target_text(r.target, r.memory);
+      if (!target_cell.empty()) {
+        met_cell = std::string(meets(r.target, median, floor_median, r.memory) ? "yes" : "no") +
+                   " / " + (meets(r.target, p99, floor_p99, r.memory) ? "yes" : "no");
       }
-      if (floor_p99 > 0) ratio_p99 = fixed(static_cast<double>(p99) / floor_p99, 2);
     }
-    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " + micros(median) +
-           " | " + micros(p99) + " | " + floor_cell + " | " + ratio_median + " | " + ratio_p99 +
-           " |\n";
+    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " +
+           amount(median, r.memory) + " | " + amount(p99, r.memory) + " | " + floor_cells + " | " +
+           ratio_cells + " | " + target_cell + " | " + met_cell + " |\n";
   }
   for (const auto& r : results_) {
     if (r.repeated > 0) {
@@ -169,17 +217,31 @@ std::string bench_report::json(const std::string& mode) const {
       continue;
     }
     int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
-    out += ", \"iterations\": " + std::to_string(r.samples_ns.size()) +
-           ", \"median_ns\": " + std::to_string(median) + ", \"p99_ns\": " + std::to_string(p99) +
-           ", \"min_ns\": " + std::to_string(bench_quantile(r.samples_ns, 0.0)) +
+    // Memory results carry bytes where time results carry nanoseconds.
+    const std::string unit = r.memory ? "_bytes" : "_ns";
+    out += ", \"iterations\": " + std::to_string(r.samples_ns.size()) + ", \"median" + unit +
+           "\": " + std::to_string(median) + ", \"p99" + unit + "\": " + std::to_string(p99) +
+           ", \"min" + unit + "\": " + std::to_string(bench_quantile(r.samples_ns, 0.0)) +
            ", \"repeated\": " + std::to_string(r.repeated);
     if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
       int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
       int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
       out += ", \"floor\": \"" + json_escape(f->name) + "\"";
-      if (floor_median > 0 && floor_p99 > 0) {
+      if (r.memory) {
+        out += ", \"excess_median_bytes\": " + std::to_string(median - floor_median) +
+               ", \"excess_p99_bytes\": " + std::to_string(p99 - floor_p99);
+        if (r.target.excess_bytes > 0) {
+          out += ", \"target_excess_bytes\": " + std::to_string(r.target.excess_bytes);
+        }
+      } else if (floor_median > 0 && floor_p99 > 0) {
         out += ", \"ratio_median\": " + fixed(static_cast<double>(median) / floor_median, 3) +
                ", \"ratio_p99\": " + fixed(static_cast<double>(p99) / floor_p99, 3);
+        if (r.target.ratio > 0) out += ", \"target_ratio\": " + fixed(r.target.ratio, 2);
+      }
+      if (r.target.ratio > 0 || r.target.excess_bytes > 0) {
+        out += std::string(", \"met_median\": ") +
+               (meets(r.target, median, floor_median, r.memory) ? "true" : "false") +
+               ", \"met_p99\": " + (meets(r.target, p99, floor_p99, r.memory) ? "true" : "false");
       }
     }
     out += "}";

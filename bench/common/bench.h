@@ -9,12 +9,32 @@
 #include <string>
 #include <vector>
 
+// A build of the service to measure. The benchmark measures the service
+// beside it by default; more builds (an older one, say) are measured in the
+// same run, their scenario names ending in "@label".
+struct bench_service {
+  std::string label;  // empty for the default build
+  std::string path;   // the service binary; its pull module sits beside it
+};
+
 struct bench_options {
   bool quick = false;      // fewer iterations: a smoke run in seconds
   bool verbose = false;    // let the client library's log lines through
   std::string only_group;  // run this group alone when not empty
   std::string json_path;   // where the JSON report goes; empty: nowhere
+  std::vector<bench_service> services;  // at least the default build
 };
+
+// What a scenario must reach beside its floor: its median at most `ratio`
+// times the floor's, or (for a memory result) at most `excess_bytes` above it.
+struct bench_target {
+  double ratio = 0;          // 0: no ratio target
+  int64_t excess_bytes = 0;  // 0: no memory target
+};
+
+// `name` with the label of `service` appended ("name@label"), unchanged for
+// the default build.
+std::string bench_scenario_name(const std::string& name, const bench_service& service);
 
 // One scenario's measurements. `floor` names another result measured in the
 // same run: the cost of the same exchange with nothing but the transport.
@@ -23,7 +43,9 @@ struct bench_result {
   std::string name;
   std::string description;
   std::string floor;
-  std::vector<int64_t> samples_ns;  // one per timed iteration
+  bench_target target;
+  bool memory = false;              // samples are bytes, not nanoseconds
+  std::vector<int64_t> samples_ns;  // one per timed iteration (bytes when `memory`)
   int repeated = 0;                 // iterations redone after a recovery
   bool failed = false;              // an iteration's body reported failure
   std::string failure;
@@ -35,12 +57,17 @@ struct bench_result {
 // iteration is tried again; only the try that succeeds is timed. The reason:
 // the shared-memory object has one machine-wide name, and a test run
 // elsewhere on the machine may remove it under a running service.
+// `timed`, when set, replaces `body` for cases that time only a part of their
+// iteration themselves (connect to handshake, without the process's exit):
+// it returns false on failure and puts the time into its argument.
 struct bench_case {
   std::string name;
   std::string description;
   std::string floor;
   std::function<bool()> body;
   std::function<bool()> recover = {};
+  bench_target target = {};
+  std::function<bool(int64_t* elapsed_ns)> timed = {};
 };
 
 // Runs every case `warmup` times untimed, then `iterations` times timed, the

@@ -9,3 +9,5 @@
 bool bench_group_queries(const bench_options& options, bench_report* report);
 // The 24-tile deck, on an open connection and on a fresh one.
 bool bench_group_deck(const bench_options& options, bench_report* report);
+// Connect to handshake through the activator, and memory after it.
+bool bench_group_startup(const bench_options& options, bench_report* report);
