@@ -52,6 +52,10 @@ bool BenchSeededService::start(const std::vector<bench_service>& services) {
   return true;
 }
 
+bool BenchSeededService::start() {
+  return start({{"", std::string(SITEDECK_BIN_DIR) + "/browser-sitedeck-service"}});
+}
+
 int BenchSeededService::connect(size_t index, SdsConnection* out) {
   if (index >= services_.size()) return SDS_ERROR_IO_ERROR;
   return sds_client_connect(services_[index]->socket_path(), out, 10000);

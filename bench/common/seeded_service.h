@@ -31,9 +31,12 @@ class BenchSeededService {
   // Seeds the database and starts one activator per build in `services`;
   // false (reason on stderr) when any of that fails.
   bool start(const std::vector<bench_service>& services);
+  // The same with the service beside the benchmark alone.
+  bool start();
   // A new connection to build `index`, which its activator gives a service
   // process of its own.
   int connect(size_t index, SdsConnection* out);
+  int connect(SdsConnection* out) { return connect(0, out); }
   // The activator of build `index`.
   BenchActivated& activated(size_t index) { return *services_[index]; }
   // Item ids are 1 to kBenchDeckItems.
