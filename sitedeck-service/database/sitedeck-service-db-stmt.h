@@ -28,3 +28,6 @@ int sds_db_reason_or(sqlite3* handle, int fallback);
 bool sds_db_prepare(sqlite3* handle, char* sql, SqliteStmt* stmt, int* error_code);
 // Checks the result of a bind; on failure logs and sets `error_code`.
 bool sds_db_bind_ok(sqlite3* handle, int rc, int* error_code);
+// Reads an icon size text "WIDTHxHEIGHT" (each number as atoi reads it,
+// saturated); false, with the outputs untouched, when there is no x.
+bool sds_db_parse_icon_size(const char* text, int* width, int* height);
