@@ -1,7 +1,9 @@
 // Icons in the item table, the serving half: an item's pixel rows with the
 // width and height its icon_size text gives, for command 7, and the reading
 // of that size text, which the storing half (sitedeck-service-db-icon.cpp)
-// shares.
+// shares. Command 7 copies the pixels once, from the file's pages straight
+// into the shared memory: a copy on the heap first, and SQLite's gathering
+// of the pages into one value before that, cost more than the copy itself.
 #include <climits>
 #include <cstring>
 
@@ -40,6 +42,50 @@ bool sds_db_parse_icon_size(const char* text, int* width, int* height) {
   *width = leading_int(text);
   *height = leading_int(x + 1);
   return true;
+}
+
+int sds_copy_blob_from_db(int id, int* length, int* height, int* width,
+                          unsigned char* (*place)(int length, void* user), void* user) {
+  if (place == nullptr) {
+    SDS_LOGE("NULL check::value");
+    return SDS_ERROR_INVALID_PARAMETER;
+  }
+  if (length == nullptr) {
+    SDS_LOGE("NULL check::blob_length");
+    return SDS_ERROR_INVALID_PARAMETER;
+  }
+  if (width == nullptr) {
+    SDS_LOGE("NULL check::blob_width");
+    return SDS_ERROR_INVALID_PARAMETER;
+  }
+  if (height == nullptr) {
+    SDS_LOGE("NULL check::blob_height");
+    return SDS_ERROR_INVALID_PARAMETER;
+  }
+  int code = SDS_ERROR_NONE;
+  SqliteKeptStmt transaction;
+  (void)sds_db_check_property_blob(sds_db_handle, id, kSiteDeck, "icon_data", &transaction, length,
+                                   &code);
+  if (code != SDS_ERROR_NONE) {
+    SDS_LOGE("Error : %s", sds_error_string(code));
+    return code;
+  }
+  char* size_text = nullptr;
+  (void)sds_db_get_property_string(sds_db_handle, id, kSiteDeck, "icon_size", &size_text, &code);
+  UniqueCStr size_owner(size_text);
+  if (code != SDS_ERROR_NONE) {
+    SDS_LOGE("Error : %s", sds_error_string(code));
+    return code;
+  }
+  (void)sds_db_parse_icon_size(size_text, width, height);
+  unsigned char* destination = place(*length, user);
+  if (destination != nullptr &&
+      sds_db_read_property_blob(sds_db_handle, id, kSiteDeck, "icon_data", destination, *length,
+                                &code) != 0) {
+    SDS_LOGE("Error : %s", sds_error_string(code));
+    return code;
+  }
+  return SDS_ERROR_NONE;
 }
 
 int sds_get_blob_from_db(int id, int* length, int* height, int* width, unsigned char** bytes) {
