@@ -110,11 +110,13 @@ bool BenchActivated::wait_idle(int timeout_ms) const {
   }
 }
 
-int64_t bench_resident_bytes(pid_t pid) {
+int64_t bench_resident_bytes(pid_t pid) { return bench_status_bytes(pid, "VmRSS:"); }
+
+int64_t bench_status_bytes(pid_t pid, const char* wanted) {
   std::ifstream in("/proc/" + std::to_string(pid) + "/status");
   std::string key;
   while (in >> key) {
-    if (key == "VmRSS:") {
+    if (key == wanted) {
       int64_t kib = -1;
       if (in >> kib) return kib * 1024;
       return -1;

@@ -41,3 +41,5 @@ class BenchActivated {
 
 // Resident memory (VmRSS) of process `pid` in bytes, or -1.
 int64_t bench_resident_bytes(pid_t pid);
+// A memory line of /proc/PID/status ("VmRSS:", "RssAnon:"...) in bytes, or -1.
+int64_t bench_status_bytes(pid_t pid, const char* key);
