@@ -17,4 +17,8 @@ constexpr sds_pull_calls kLinkedCalls = {
 
 extern "C" const sds_pull_calls* sds_pull_module_calls(void) { return &kLinkedCalls; }
 
+// Inside the module the service binary's own sds_pull_get_calls is the one
+// that counts; a second definition there would only hide it.
+#ifndef SITEDECK_PULL_MODULE
 const sds_pull_calls* sds_pull_get_calls(void) { return sds_pull_module_calls(); }
+#endif

@@ -5,8 +5,10 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <filesystem>
 #include <fstream>
+#include <set>
 #include <string>
 
 #include "sitedeck-client-commands.h"
@@ -33,6 +35,42 @@ std::string pull_libraries_mapped(pid_t pid) {
     }
   }
   return found;
+}
+
+// The names `file` defines for the dynamic linker (nm -D), without versions.
+std::set<std::string> dynamic_definitions(const std::string& file) {
+  std::set<std::string> names;
+  std::string command = "nm -D --defined-only '" + file + "' 2>/dev/null";
+  FILE* pipe = popen(command.c_str(), "r");
+  if (pipe == nullptr) return names;
+  char line[1024];
+  while (std::fgets(line, sizeof line, pipe) != nullptr) {
+    std::string text(line);
+    size_t name = text.find_last_of(' ');
+    if (name == std::string::npos) continue;
+    std::string symbol = text.substr(name + 1);
+    while (!symbol.empty() && (symbol.back() == '\n' || symbol.back() == '\r')) symbol.pop_back();
+    if (symbol.find('@') == std::string::npos) names.insert(symbol);
+  }
+  (void)pclose(pipe);
+  return names;
+}
+
+// What the module uses of the service must come from the binary, not from a
+// copy of the same module file inside it: a copy keeps state of its own (a
+// cache, a handle) that the binary's code never sees, and nothing fails.
+TEST(PullModule, ModuleCarriesNoCopyOfWhatTheBinaryExports) {
+  const std::string bin = SITEDECK_BIN_DIR;
+  std::set<std::string> binary = dynamic_definitions(bin + "/browser-sitedeck-service");
+  std::set<std::string> module = dynamic_definitions(bin + "/libsitedeck-pull.so");
+  ASSERT_FALSE(binary.empty());
+  ASSERT_FALSE(module.empty());
+  std::string both;
+  for (const auto& name : module) {
+    if (binary.count(name) != 0) both += " " + name;
+  }
+  EXPECT_EQ(both, "") << "defined in both the binary and the module; such a module file belongs "
+                         "to SERVE_SOURCES in CMakeLists.txt";
 }
 
 TEST(PullModule, ServingLoadsNoPullLibraryAndInitializeLoadsTheModule) {
