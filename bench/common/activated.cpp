@@ -13,6 +13,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <string>
 
@@ -108,6 +109,22 @@ bool BenchActivated::wait_idle(int timeout_ms) const {
     if (std::chrono::steady_clock::now() > deadline) return false;
     (void)sched_yield();
   }
+}
+
+int64_t bench_cpu_time_ns(pid_t pid) {
+  std::error_code ec;
+  int64_t total = 0;
+  bool any = false;
+  for (const auto& task :
+       std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", ec)) {
+    std::ifstream in(task.path() / "schedstat");
+    int64_t on_cpu = 0;
+    if (in >> on_cpu) {
+      total += on_cpu;
+      any = true;
+    }
+  }
+  return any ? total : -1;
 }
 
 int64_t bench_resident_bytes(pid_t pid) { return bench_status_bytes(pid, "VmRSS:"); }

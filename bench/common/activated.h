@@ -41,5 +41,8 @@ class BenchActivated {
 
 // Resident memory (VmRSS) of process `pid` in bytes, or -1.
 int64_t bench_resident_bytes(pid_t pid);
+// CPU time process `pid` has had so far, all its threads together (from
+// /proc/PID/task/*/schedstat, in nanoseconds), or -1.
+int64_t bench_cpu_time_ns(pid_t pid);
 // A memory line of /proc/PID/status ("VmRSS:", "RssAnon:"...) in bytes, or -1.
 int64_t bench_status_bytes(pid_t pid, const char* key);

@@ -18,7 +18,13 @@ std::string fixed(double value, int decimals) {
   return buffer;
 }
 
-std::string micros(int64_t ns) { return fixed(static_cast<double>(ns) / 1000.0, 1); }
+// A time in the unit that keeps it readable, or a byte count in MiB.
+std::string amount(const bench_result& r, int64_t value) {
+  auto v = static_cast<double>(value);
+  if (r.bytes) return fixed(v / (1024.0 * 1024.0), 1) + " MiB";
+  if (value >= 10'000'000) return fixed(v / 1e6, 1) + " ms";
+  return fixed(v / 1000.0, 1) + " µs";
+}
 
 std::string json_escape(const std::string& text) {
   std::string out;
@@ -34,6 +40,7 @@ std::string json_escape(const std::string& text) {
 // case can; `elapsed_ns` gets the time of the try that succeeded.
 bool run_once(const bench_case& c, bench_result* result, int64_t* elapsed_ns) {
   for (int attempt = 1; attempt <= kTriesPerIteration; ++attempt) {
+    if (c.prepare && !c.prepare()) return false;
     int64_t elapsed = 0;
     bool ok = false;
     if (c.timed) {
@@ -54,39 +61,6 @@ bool run_once(const bench_case& c, bench_result* result, int64_t* elapsed_ns) {
   return false;
 }
 
-// A sample as people read it: microseconds, or MiB for memory.
-std::string amount(int64_t value, bool memory) {
-  if (memory) return fixed(static_cast<double>(value) / (1024.0 * 1024.0), 2) + " MiB";
-  return micros(value) + " µs";
-}
-
-// How `value` stands to `floor_value`: a ratio, or the excess for memory.
-std::string relation(int64_t value, int64_t floor_value, bool memory) {
-  if (memory) {
-    double excess = static_cast<double>(value - floor_value) / (1024.0 * 1024.0);
-    std::string text = excess >= 0 ? "+" : "";
-    text += fixed(excess, 2);
-    text += " MiB";
-    return text;
-  }
-  return floor_value > 0 ? fixed(static_cast<double>(value) / floor_value, 2) : "—";
-}
-
-bool meets(const bench_target& target, int64_t value, int64_t floor_value, bool memory) {
-  if (memory) return target.excess_bytes > 0 && value - floor_value <= target.excess_bytes;
-  return target.ratio > 0 && floor_value > 0 &&
-         static_cast<double>(value) <= target.ratio * static_cast<double>(floor_value);
-}
-
-std::string target_text(const bench_target& target, bool memory) {
-  if (memory && target.excess_bytes > 0) {
-    return "≤ +" + fixed(static_cast<double>(target.excess_bytes) / (1024.0 * 1024.0), 0) +
-           " MiB";
-  }
-  if (!memory && target.ratio > 0) return "≤ " + fixed(target.ratio, 1);
-  return "";
-}
-
 }  // namespace
 
 std::vector<bench_result> bench_time_cases(const std::string& group,
@@ -98,6 +72,7 @@ std::vector<bench_result> bench_time_cases(const std::string& group,
     results[c].name = cases[c].name;
     results[c].description = cases[c].description;
     results[c].floor = cases[c].floor;
+    results[c].floor_scale = cases[c].floor_scale;
     results[c].target = cases[c].target;
     results[c].samples_ns.reserve(static_cast<size_t>(iterations));
     for (int i = 0; i < warmup && !results[c].failed; ++i) {
@@ -157,39 +132,54 @@ const bench_result* bench_report::find(const std::string& name) const {
   return nullptr;
 }
 
+bench_report::bench_summary bench_report::summarise(const bench_result& r) const {
+  bench_summary s;
+  s.median = bench_quantile(r.samples_ns, 0.5);
+  s.p99 = bench_quantile(r.samples_ns, 0.99);
+  s.floor = r.floor.empty() ? nullptr : find(r.floor);
+  if (s.floor != nullptr) {
+    double scale = r.floor_scale > 0 ? r.floor_scale : 1.0;
+    double floor_median = static_cast<double>(bench_quantile(s.floor->samples_ns, 0.5)) * scale;
+    double floor_p99 = static_cast<double>(bench_quantile(s.floor->samples_ns, 0.99)) * scale;
+    if (floor_median > 0) s.ratio_median = static_cast<double>(s.median) / floor_median;
+    if (floor_p99 > 0) s.ratio_p99 = static_cast<double>(s.p99) / floor_p99;
+  }
+  if (r.target > 0) {
+    double measured = s.floor != nullptr ? s.ratio_median : static_cast<double>(s.median);
+    s.target_met = measured > 0 && measured <= r.target;
+  }
+  return s;
+}
+
 bool bench_report::any_failed() const {
   return std::any_of(results_.begin(), results_.end(), [](const auto& r) { return r.failed; });
 }
 
 std::string bench_report::markdown() const {
   std::string out =
-      "| scenario | iterations | median | p99 | floor | floor median | floor p99 | ratio median "
-      "| ratio p99 | target | met (median / p99) |\n"
-      "|---|---:|---:|---:|---|---:|---:|---:|---:|---|---|\n";
+      "| scenario | iterations | median | p99 | floor | ratio median | ratio p99 | target |\n"
+      "|---|---:|---:|---:|---|---:|---:|---:|\n";
   for (const auto& r : results_) {
     std::string name = r.group + "/" + r.name;
     if (r.failed) {
-      out += "| " + name + " | failed: " + r.failure + " | | | | | | | | | |\n";
+      out += "| " + name + " | failed: " + r.failure + " | | | | | | |\n";
       continue;
     }
-    int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
-    std::string floor_cells = "— | | ", ratio_cells = "— | —", target_cell, met_cell;
-    if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
-      int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
-      int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
-      floor_cells = f->name + " | " + amount(floor_median, r.memory) + " | " +
-                    amount(floor_p99, r.memory);
-      ratio_cells = relation(median, floor_median, r.memory) + " | " +
-                    relation(p99, floor_p99, r.memory);
-      target_cell = target_text(r.target, r.memory);
-      if (!target_cell.empty()) {
-        met_cell = std::string(meets(r.target, median, floor_median, r.memory) ? "yes" : "no") +
-                   " / " + (meets(r.target, p99, floor_p99, r.memory) ? "yes" : "no");
-      }
+    const bench_summary s = summarise(r);
+    std::string floor_cell = "—", ratio_median = "—", ratio_p99 = "—", target = "—";
+    if (s.floor != nullptr) {
+      floor_cell = s.floor->name;
+      if (r.floor_scale != 1.0) floor_cell += " × " + fixed(r.floor_scale, 0);
+      if (s.ratio_median > 0) ratio_median = fixed(s.ratio_median, 2);
+      if (s.ratio_p99 > 0) ratio_p99 = fixed(s.ratio_p99, 2);
     }
-    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " +
-           amount(median, r.memory) + " | " + amount(p99, r.memory) + " | " + floor_cells + " | " +
-           ratio_cells + " | " + target_cell + " | " + met_cell + " |\n";
+    if (r.target > 0) {
+      target = "≤ " + (r.bytes ? amount(r, static_cast<int64_t>(r.target)) : fixed(r.target, 2)) +
+               (s.target_met ? " ✓" : " ✗");
+    }
+    out += "| " + name + " | " + std::to_string(r.samples_ns.size()) + " | " + amount(r, s.median) +
+           " | " + amount(r, s.p99) + " | " + floor_cell + " | " + ratio_median + " | " +
+           ratio_p99 + " | " + target + " |\n";
   }
   for (const auto& r : results_) {
     if (r.repeated > 0) {
@@ -197,6 +187,7 @@ std::string bench_report::markdown() const {
              " iteration(s) repeated after a recovery (another process disturbed the run)\n";
     }
   }
+  for (const auto& n : notes_) out += "\n" + n + "\n";
   return out;
 }
 
@@ -216,36 +207,31 @@ std::string bench_report::json(const std::string& mode) const {
       out += ", \"failed\": \"" + json_escape(r.failure) + "\"}";
       continue;
     }
-    int64_t median = bench_quantile(r.samples_ns, 0.5), p99 = bench_quantile(r.samples_ns, 0.99);
-    // Memory results carry bytes where time results carry nanoseconds.
-    const std::string unit = r.memory ? "_bytes" : "_ns";
-    out += ", \"iterations\": " + std::to_string(r.samples_ns.size()) + ", \"median" + unit +
-           "\": " + std::to_string(median) + ", \"p99" + unit + "\": " + std::to_string(p99) +
-           ", \"min" + unit + "\": " + std::to_string(bench_quantile(r.samples_ns, 0.0)) +
+    const bench_summary s = summarise(r);
+    out += ", \"unit\": \"" + std::string(r.bytes ? "bytes" : "ns") +
+           "\", \"iterations\": " + std::to_string(r.samples_ns.size()) +
+           ", \"median_ns\": " + std::to_string(s.median) +
+           ", \"p99_ns\": " + std::to_string(s.p99) +
+           ", \"min_ns\": " + std::to_string(bench_quantile(r.samples_ns, 0.0)) +
            ", \"repeated\": " + std::to_string(r.repeated);
-    if (const bench_result* f = r.floor.empty() ? nullptr : find(r.floor)) {
-      int64_t floor_median = bench_quantile(f->samples_ns, 0.5);
-      int64_t floor_p99 = bench_quantile(f->samples_ns, 0.99);
-      out += ", \"floor\": \"" + json_escape(f->name) + "\"";
-      if (r.memory) {
-        out += ", \"excess_median_bytes\": " + std::to_string(median - floor_median) +
-               ", \"excess_p99_bytes\": " + std::to_string(p99 - floor_p99);
-        if (r.target.excess_bytes > 0) {
-          out += ", \"target_excess_bytes\": " + std::to_string(r.target.excess_bytes);
-        }
-      } else if (floor_median > 0 && floor_p99 > 0) {
-        out += ", \"ratio_median\": " + fixed(static_cast<double>(median) / floor_median, 3) +
-               ", \"ratio_p99\": " + fixed(static_cast<double>(p99) / floor_p99, 3);
-        if (r.target.ratio > 0) out += ", \"target_ratio\": " + fixed(r.target.ratio, 2);
+    if (s.floor != nullptr) {
+      out += ", \"floor\": \"" + json_escape(s.floor->name) + "\"";
+      if (r.floor_scale != 1.0) out += ", \"floor_scale\": " + fixed(r.floor_scale, 3);
+      if (s.ratio_median > 0 && s.ratio_p99 > 0) {
+        out += ", \"ratio_median\": " + fixed(s.ratio_median, 3) +
+               ", \"ratio_p99\": " + fixed(s.ratio_p99, 3);
       }
-      if (r.target.ratio > 0 || r.target.excess_bytes > 0) {
-        out += std::string(", \"met_median\": ") +
-               (meets(r.target, median, floor_median, r.memory) ? "true" : "false") +
-               ", \"met_p99\": " + (meets(r.target, p99, floor_p99, r.memory) ? "true" : "false");
-      }
+    }
+    if (r.target > 0) {
+      out += ", \"target\": " + fixed(r.target, 3) +
+             ", \"target_met\": " + (s.target_met ? "true" : "false");
     }
     out += "}";
   }
-  out += "\n  ]\n}\n";
+  out += "\n  ],\n  \"notes\": [";
+  for (size_t i = 0; i < notes_.size(); ++i) {
+    out += (i == 0 ? "\"" : ", \"") + json_escape(notes_[i]) + "\"";
+  }
+  out += "]\n}\n";
   return out;
 }

@@ -25,13 +25,6 @@ struct bench_options {
   std::vector<bench_service> services;  // at least the default build
 };
 
-// What a scenario must reach beside its floor: its median at most `ratio`
-// times the floor's, or (for a memory result) at most `excess_bytes` above it.
-struct bench_target {
-  double ratio = 0;          // 0: no ratio target
-  int64_t excess_bytes = 0;  // 0: no memory target
-};
-
 // `name` with the label of `service` appended ("name@label"), unchanged for
 // the default build.
 std::string bench_scenario_name(const std::string& name, const bench_service& service);
@@ -43,9 +36,14 @@ struct bench_result {
   std::string name;
   std::string description;
   std::string floor;
-  bench_target target;
-  bool memory = false;              // samples are bytes, not nanoseconds
-  std::vector<int64_t> samples_ns;  // one per timed iteration (bytes when `memory`)
+  // The ratio to the floor is taken against floor x floor_scale: a pull of
+  // 5000 items beside the pull of 50 compares the time per item.
+  double floor_scale = 1.0;
+  // The goal: the median ratio to the floor (or, for a byte count with no
+  // floor, the median itself) must not exceed it. 0: none.
+  double target = 0.0;
+  bool bytes = false;               // samples are byte counts, not times
+  std::vector<int64_t> samples_ns;  // one per timed iteration
   int repeated = 0;                 // iterations redone after a recovery
   bool failed = false;              // an iteration's body reported failure
   std::string failure;
@@ -57,16 +55,20 @@ struct bench_result {
 // iteration is tried again; only the try that succeeds is timed. The reason:
 // the shared-memory object has one machine-wide name, and a test run
 // elsewhere on the machine may remove it under a running service.
-// `timed`, when set, replaces `body` for cases that time only a part of their
-// iteration themselves (connect to handshake, without the process's exit):
-// it returns false on failure and puts the time into its argument.
 struct bench_case {
   std::string name;
   std::string description;
   std::string floor;
   std::function<bool()> body;
   std::function<bool()> recover = {};
-  bench_target target = {};
+  // Runs untimed before every try of an iteration (a fresh start state, say);
+  // false fails the iteration.
+  std::function<bool()> prepare = {};
+  double floor_scale = 1.0;  // as in bench_result
+  double target = 0.0;       // as in bench_result
+  // When set, replaces `body` for a case that times only a part of its
+  // iteration itself (connect to handshake, without the process's exit):
+  // false on failure, the time in its argument.
   std::function<bool(int64_t* elapsed_ns)> timed = {};
 };
 
@@ -85,6 +87,9 @@ int64_t bench_quantile(const std::vector<int64_t>& samples_ns, double q);
 class bench_report {
  public:
   void add(bench_result result);
+  // A line printed under the table (and listed in the JSON): a condition of
+  // the run that its numbers depend on.
+  void note(std::string text) { notes_.push_back(std::move(text)); }
   // Scenario's iteration count: `full`, or `quick` in a quick run.
   static int iterations(const bench_options& options, int full, int quick);
   // The Markdown table for people.
@@ -94,8 +99,18 @@ class bench_report {
   bool any_failed() const;
 
  private:
+  struct bench_summary {
+    int64_t median = 0;
+    int64_t p99 = 0;
+    const bench_result* floor = nullptr;
+    double ratio_median = 0;  // 0 when there is no floor
+    double ratio_p99 = 0;
+    bool target_met = false;
+  };
   const bench_result* find(const std::string& name) const;
+  bench_summary summarise(const bench_result& r) const;
   std::vector<bench_result> results_;
+  std::vector<std::string> notes_;
 };
 
 // A scenario group: measures its scenarios and adds them to the report.

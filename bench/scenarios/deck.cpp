@@ -17,7 +17,7 @@
 
 namespace {
 
-constexpr bench_target kDeckTarget = {1.5, 0};
+constexpr double kDeckTarget = 1.5;
 // Requests per tile besides the icon: URL, title, colour, icon size, two flags.
 constexpr int kSmallRequestsPerTile = 6;
 
@@ -78,10 +78,13 @@ bool bench_group_deck(const bench_options& options, bench_report* report) {
       connection->close();
       return service.connect(s, connection) == SDS_ERROR_NONE;
     };
-    open_cases.push_back({bench_scenario_name("deck-24", options.services[s]),
-                          "ids, then 24 tiles of 7 requests each, on an open connection",
-                          "floor-deck", [connection] { return read_deck(*connection); }, reconnect,
-                          kDeckTarget});
+    open_cases.push_back({.name = bench_scenario_name("deck-24", options.services[s]),
+                          .description =
+                              "ids, then 24 tiles of 7 requests each, on an open connection",
+                          .floor = "floor-deck",
+                          .body = [connection] { return read_deck(*connection); },
+                          .recover = reconnect,
+                          .target = kDeckTarget});
   }
   for (auto& result :
        bench_time_cases("deck", open_cases, bench_report::iterations(options, 500, 50),

@@ -15,8 +15,8 @@
 namespace {
 
 // Targets: a URL within half again the floor's time, an icon within twice.
-constexpr bench_target kUrlTarget = {1.5, 0};
-constexpr bench_target kIconTarget = {2.0, 0};
+constexpr double kUrlTarget = 1.5;
+constexpr double kIconTarget = 2.0;
 
 // One build's connection and the item it asks for next.
 struct query_client {
@@ -57,26 +57,33 @@ bool bench_group_queries(const bench_options& options, bench_report* report) {
       return service.connect(s, &client->connection) == SDS_ERROR_NONE;
     };
     const bench_service& build = options.services[s];
-    cases.push_back({bench_scenario_name("cmd3-url", build),
-                     "command 3: header, status, 40-byte string", "floor-url",
-                     [client] {
-                       UniqueCStr url;
-                       return sds_client_get_url(client->connection,
-                                                 BenchSeededService::item_id(client->url_index++),
-                                                 &url) == SDS_ERROR_NONE;
-                     },
-                     reconnect, kUrlTarget});
-    cases.push_back({bench_scenario_name("cmd7-icon", build),
-                     "command 7: 192x192 icon through shared memory, pixels copied out",
-                     "floor-icon",
-                     [client] {
-                       sds_client_icon icon;
-                       return sds_client_get_icon(client->connection,
-                                                  BenchSeededService::item_id(client->icon_index++),
-                                                  &icon) == SDS_ERROR_NONE &&
-                              icon.byte_count == kBenchIconBytes;
-                     },
-                     reconnect, kIconTarget});
+    cases.push_back({.name = bench_scenario_name("cmd3-url", build),
+                     .description = "command 3: header, status, 40-byte string",
+                     .floor = "floor-url",
+                     .body =
+                         [client] {
+                           UniqueCStr url;
+                           return sds_client_get_url(
+                                      client->connection,
+                                      BenchSeededService::item_id(client->url_index++),
+                                      &url) == SDS_ERROR_NONE;
+                         },
+                     .recover = reconnect,
+                     .target = kUrlTarget});
+    cases.push_back({.name = bench_scenario_name("cmd7-icon", build),
+                     .description = "command 7: 192x192 icon through shared memory, pixels copied out",
+                     .floor = "floor-icon",
+                     .body =
+                         [client] {
+                           sds_client_icon icon;
+                           return sds_client_get_icon(
+                                      client->connection,
+                                      BenchSeededService::item_id(client->icon_index++),
+                                      &icon) == SDS_ERROR_NONE &&
+                                  icon.byte_count == kBenchIconBytes;
+                         },
+                     .recover = reconnect,
+                     .target = kIconTarget});
   }
   for (auto& result :
        bench_time_cases("queries", cases, bench_report::iterations(options, 20000, 2000),
