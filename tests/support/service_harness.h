@@ -34,6 +34,9 @@ class ServiceHarness {
   bool start_direct_wrapped(const std::vector<std::string>& wrapper);
   // Runs the service with no activation at all.
   bool start_unactivated();
+  // Runs `path` instead of the service beside the tests (a copy elsewhere);
+  // call before starting.
+  void set_service_path(const std::string& path) { service_path_ = path; }
 
   // Waits until the directly started service blocks in accept(), so that its
   // signal handling is in place.
