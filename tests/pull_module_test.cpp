@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <cstdio>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <set>
@@ -38,19 +39,20 @@ std::string pull_libraries_mapped(pid_t pid) {
 }
 
 // The names `file` defines for the dynamic linker (nm -D), without versions.
+// Weak definitions (inline and template code every object file carries, the
+// same everywhere) are left out.
 std::set<std::string> dynamic_definitions(const std::string& file) {
   std::set<std::string> names;
   std::string command = "nm -D --defined-only '" + file + "' 2>/dev/null";
   FILE* pipe = popen(command.c_str(), "r");
   if (pipe == nullptr) return names;
-  char line[1024];
+  char line[4096];
   while (std::fgets(line, sizeof line, pipe) != nullptr) {
-    std::string text(line);
-    size_t name = text.find_last_of(' ');
-    if (name == std::string::npos) continue;
-    std::string symbol = text.substr(name + 1);
-    while (!symbol.empty() && (symbol.back() == '\n' || symbol.back() == '\r')) symbol.pop_back();
-    if (symbol.find('@') == std::string::npos) names.insert(symbol);
+    char type = 0;
+    char symbol[4096] = {};
+    if (std::sscanf(line, "%*s %c %4095s", &type, symbol) != 2) continue;
+    if (type == 'W' || type == 'V' || type == 'w' || type == 'v' || type == 'u') continue;
+    if (std::strchr(symbol, '@') == nullptr) names.insert(symbol);
   }
   (void)pclose(pipe);
   return names;
