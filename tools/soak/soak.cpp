@@ -30,10 +30,10 @@
 #include "database/sitedeck-service-db-interface.h"
 #include "dlog.h"
 #include "proc_stats.h"
+#include "sitedeck-client-commands.h"
 #include "sitedeck-client.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "support/raw_requests.h"
 
 extern char** environ;
 
@@ -188,23 +188,24 @@ int listen_socket() {
 }
 
 // One request of the mix; false when its reply was not the expected one.
-bool one_request(const SdsConnection& c, long n) {
+bool one_request(SdsConnection& c, long n) {
   const int32_t cmd = kCommands[n % 5];
-  const int32_t id = static_cast<int32_t>(1 + (n / 5) % kItems);
-  std::string text;
-  int32_t value = 0, width = 0, height = 0;
-  std::vector<int32_t> ids;
+  const auto id = static_cast<int32_t>(1 + (n / 5) % kItems);
+  UniqueCStr text;
+  int32_t value = 0;
+  sds_client_icon icon;
+  sds_client_ids ids;
   switch (cmd) {
     case SDS_CMD_GET_URL:
-      return request_text(c, cmd, id, &text) == SDS_ERROR_NONE;
+      return sds_client_get_url(c, id, &text) == SDS_ERROR_NONE;
     case SDS_CMD_GET_TOUCH_ICON_EXISTS:
-      return request_int(c, cmd, id, &value) == SDS_ERROR_NONE && value == 1;
+      return sds_client_get_touch_icon_exists(c, id, &value) == SDS_ERROR_NONE && value == 1;
     case SDS_CMD_GET_ICON:
-      return request_icon(c, id, &value, &width, &height) == SDS_ERROR_NONE && value == 12996;
+      return sds_client_get_icon(c, id, &icon) == SDS_ERROR_NONE && icon.byte_count == 12996;
     case SDS_CMD_GET_NEXT_UPDATE_DURATION:
-      return request_next_update(c, &value) == SDS_ERROR_NONE && value == 3600;
+      return sds_client_get_next_update_duration(c, &value) == SDS_ERROR_NONE && value == 3600;
     default:
-      return request_ids(c, &ids) == SDS_ERROR_NONE && ids.size() == kItems;
+      return sds_client_get_ids_by_dirty(c, 1, &ids) == SDS_ERROR_NONE && ids.count == kItems;
   }
 }
 
@@ -244,7 +245,7 @@ bool one_connection(const Options& o, const std::string& root) {
   }
   double seconds =
       std::chrono::duration<double>(std::chrono::steady_clock::now() - started).count();
-  const bool freed = request_free_shm(c) == SDS_ERROR_NONE;
+  const bool freed = sds_client_release_shm(c) == SDS_ERROR_NONE;
   c.close();
   int status = 0;
   const bool ended = wait_for(service, 10000, &status);
@@ -306,7 +307,7 @@ bool many_connections(const Options& o, const std::string& root) {
       if (n == 0) first_activator = last_activator;
       print_row("activator", n, last_activator);
     }
-    if (request_free_shm(c) != SDS_ERROR_NONE) ++failures;
+    if (sds_client_release_shm(c) != SDS_ERROR_NONE) ++failures;
   }
   double seconds =
       std::chrono::duration<double>(std::chrono::steady_clock::now() - started).count();
