@@ -8,7 +8,9 @@
 // Not a test: a run takes minutes (tests/soak_test.cpp is the short version).
 #include <fcntl.h>
 #include <poll.h>
+#include <sched.h>
 #include <sqlite3.h>
+#include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -126,6 +128,16 @@ std::set<std::string> files_of(const std::string& root) {
 }
 
 bool shm_object_exists() { return fs::exists(SDS_SHM_FILE_PATH); }
+
+// Other service processes on this machine (tests, demos) make and remove the
+// same machine-wide shared-memory object, which would fail this run's icon
+// requests now and then. A mount namespace with a /dev/shm of its own keeps
+// them apart; it needs root, and without it the shared one is used.
+bool isolate_shared_memory() {
+  return unshare(CLONE_NEWNS) == 0 &&
+         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+         mount("tmpfs", "/dev/shm", "tmpfs", MS_NOSUID | MS_NODEV, "size=64m") == 0;
+}
 
 pid_t spawn(const std::vector<std::string>& argv, int fd3, const std::string& log_path,
             bool activation) {
@@ -342,10 +354,12 @@ int main(int argc, char** argv) {
   Options o;
   if (!parse(argc, argv, &o)) return 2;
   std::signal(SIGPIPE, SIG_IGN);
+  const bool isolated = isolate_shared_memory();
   const std::string root = make_root();
   const std::set<std::string> before = files_of(root);
   const bool shm_before = shm_object_exists();
-  std::printf("scratch root %s\n", root.c_str());
+  std::printf("scratch root %s; %s\n", root.c_str(),
+              isolated ? "a /dev/shm of its own" : "the machine's /dev/shm (not root)");
 
   bool ok = one_connection(o, root);
   ok = many_connections(o, root) && ok;
