@@ -19,10 +19,10 @@
 #include <utility>
 #include <vector>
 
+#include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
 #include "support/db_session.h"
 #include "support/pull_env.h"
-#include "support/raw_requests.h"
 #include "support/service_harness.h"
 #include "support/stand_in_servers.h"
 #include "support/temp_root.h"
@@ -40,6 +40,24 @@ constexpr const char* kHerald = "http://daily-herald.example/";
 constexpr const char* kHeraldIcon = "daily-herald/apple-touch-icon.png";
 constexpr const char* kGarden = "http://garden-life.example/";
 constexpr uid_t kNobody = 65534;
+
+// The live items as "id|url" in the service's order (command 11 for the
+// live ids, command 3 for each); empty, with `*status` set, when a step failed.
+std::vector<std::string> live_items(SdsConnection& connection, int* status = nullptr) {
+  int ignored = 0;
+  if (status == nullptr) status = &ignored;
+  sds_client_ids ids;
+  *status = sds_client_get_ids_by_dirty(connection, 1, &ids);
+  if (*status != SDS_ERROR_NONE) return {};
+  std::vector<std::string> items;
+  for (int32_t i = 0; i < ids.count; ++i) {
+    UniqueCStr url;
+    *status = sds_client_get_url(connection, ids.ids.get()[i], &url);
+    if (*status != SDS_ERROR_NONE) return {};
+    items.push_back(std::to_string(ids.ids.get()[i]) + "|" + url.get());
+  }
+  return items;
+}
 
 class FaultInjection : public ::testing::Test {
  protected:
@@ -239,8 +257,8 @@ TEST_F(FaultInjection, DatabaseFileOfGarbageIsRebuiltAndTheNextPullRefillsIt) {
       ASSERT_TRUE(service.start_direct());
       SdsConnection connection;
       ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE);
-      std::vector<int32_t> ids;
-      const int status = request_ids(connection, &ids, true);
+      sds_client_ids ids;
+      const int status = sds_client_get_full_ids(connection, &ids);
       if (c.rebuilt_at_open) {
         EXPECT_EQ(status, SDS_ERROR_NO_DATA) << service.output();
       }
@@ -270,7 +288,7 @@ TEST_F(FaultInjection, DataDirectoriesTheServiceMayNotWriteGiveStatusesNotCrashe
     EXPECT_EQ(pull_on(connection), SDS_ERROR_IO_ERROR);
     // The duration of the last answer could not be removed either.
     int32_t seconds = 0;
-    EXPECT_EQ(request_next_update(connection, &seconds), SDS_ERROR_NONE);
+    EXPECT_EQ(sds_client_get_next_update_duration(connection, &seconds), SDS_ERROR_NONE);
     EXPECT_EQ(seconds, 3600);
     EXPECT_EQ(live_items(connection), old_list);
     connection.close();
@@ -304,8 +322,8 @@ TEST_F(FaultInjection, DataDirectoriesTheServiceMayNotWriteGiveStatusesNotCrashe
     ASSERT_TRUE(service.start_direct_wrapped(kAsNobody));
     SdsConnection connection;
     ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
-    std::vector<int32_t> ids;
-    EXPECT_EQ(request_ids(connection, &ids, true), SDS_ERROR_IO_ERROR);
+    sds_client_ids ids;
+    EXPECT_EQ(sds_client_get_full_ids(connection, &ids), SDS_ERROR_IO_ERROR);
     connection.close();
     expect_normal_exit(&service);
   }
@@ -385,8 +403,8 @@ TEST_F(FaultInjection, ServerFaultsGiveTheirStatusesAndTheServiceServesOn) {
     ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE);
     EXPECT_EQ(pull_on(connection), c.status);
     // Served on: the same connection answers the next requests.
-    std::vector<int32_t> ids;
-    const int ids_status = request_ids(connection, &ids);
+    sds_client_ids ids;
+    const int ids_status = sds_client_get_ids_by_dirty(connection, 1, &ids);
     EXPECT_TRUE(ids_status == SDS_ERROR_NONE || ids_status == SDS_ERROR_NO_DATA) << ids_status;
     if (c.status == SDS_ERROR_NONE) {
       // The broken icon's site is stored, without an icon.
@@ -395,8 +413,8 @@ TEST_F(FaultInjection, ServerFaultsGiveTheirStatusesAndTheServiceServesOn) {
         if (item.ends_with(std::string("|") + kHerald)) herald = std::stoi(item);
       }
       ASSERT_GT(herald, 0);
-      int32_t bytes = 0, width = 0, height = 0;
-      EXPECT_EQ(request_icon(connection, herald, &bytes, &width, &height), SDS_ERROR_NO_DATA);
+      sds_client_icon icon;
+      EXPECT_EQ(sds_client_get_icon(connection, herald, &icon), SDS_ERROR_NO_DATA);
     }
     connection.close();
     expect_normal_exit(&service);
@@ -415,15 +433,15 @@ TEST_F(FaultInjection, LongListOpenedAFilePerIconAtOnceAndRanOutOfDescriptors) {
   SdsConnection connection;
   ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
   EXPECT_EQ(pull_on(connection), SDS_ERROR_NONE);
-  std::vector<int32_t> ids;
-  ASSERT_EQ(request_ids(connection, &ids), SDS_ERROR_NONE);
-  EXPECT_EQ(ids.size(), 300u);
+  sds_client_ids ids;
+  ASSERT_EQ(sds_client_get_ids_by_dirty(connection, 1, &ids), SDS_ERROR_NONE);
+  EXPECT_EQ(ids.count, 300);
   connection.close();
   expect_normal_exit(&service);
   EXPECT_FALSE(service.has_message("[CRITICAL]  Unable to open Image File"));
-  EXPECT_EQ(rows_of_file(data(SDS_DB_PATH),
-                         "SELECT count(*) FROM site_deck WHERE length(icon_data) > 0"),
-            "300");
+  EXPECT_EQ(
+      rows_of_file(data(SDS_DB_PATH), "SELECT count(*) FROM site_deck WHERE length(icon_data) > 0"),
+      "300");
   // Every icon arrived, so the list counts as stored.
   EXPECT_TRUE(file_exists(data(SDS_ETAG_PATH)));
   expect_no_working_files();

@@ -12,9 +12,9 @@
 #include <vector>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
 #include "support/db_session.h"
-#include "support/raw_requests.h"
 #include "support/service_harness.h"
 #include "support/temp_root.h"
 #include "tools/soak/proc_stats.h"
@@ -72,24 +72,24 @@ class Soak : public ::testing::Test {
 
 // Request `n` of the mix of commands 3, 5, 7, 10 and 11; true when its reply
 // was the expected one.
-bool one_request(const SdsConnection& c, long n) {
+bool one_request(SdsConnection& c, long n) {
   const auto id = static_cast<int32_t>(1 + (n / 5) % kItems);
-  std::string text;
-  int32_t value = 0, width = 0, height = 0;
-  std::vector<int32_t> ids;
+  UniqueCStr text;
+  int32_t value = 0;
+  sds_client_icon icon;
+  sds_client_ids ids;
   switch (n % 5) {
     case 0:
-      return request_text(c, SDS_CMD_GET_URL, id, &text) == SDS_ERROR_NONE;
+      return sds_client_get_url(c, id, &text) == SDS_ERROR_NONE;
     case 1:
-      return request_int(c, SDS_CMD_GET_TOUCH_ICON_EXISTS, id, &value) == SDS_ERROR_NONE &&
-             value == 1;
+      return sds_client_get_touch_icon_exists(c, id, &value) == SDS_ERROR_NONE && value == 1;
     case 2:
-      return request_icon(c, id, &value, &width, &height) == SDS_ERROR_NONE &&
-             value == kIconBytes && width == 57 && height == 57;
+      return sds_client_get_icon(c, id, &icon) == SDS_ERROR_NONE && icon.byte_count == kIconBytes &&
+             icon.width == 57 && icon.height == 57;
     case 3:
-      return request_next_update(c, &value) == SDS_ERROR_NONE && value == 3600;
+      return sds_client_get_next_update_duration(c, &value) == SDS_ERROR_NONE && value == 3600;
     default:
-      return request_ids(c, &ids) == SDS_ERROR_NONE && ids.size() == kItems;
+      return sds_client_get_ids_by_dirty(c, 1, &ids) == SDS_ERROR_NONE && ids.count == kItems;
   }
 }
 
@@ -110,12 +110,12 @@ TEST_F(Soak, OneConnectionServesTwoThousandRequestsWithFlatDescriptorsAndMapping
   ASSERT_GT(settled.fds, 0);
   EXPECT_EQ(last.fds, settled.fds);
   EXPECT_EQ(last.mappings, settled.mappings);
-  // 1800 icon requests copy 23 MB through the service; none of it may stay.
+  // 400 icon requests copy 5 MB through the service; none of it may stay.
   if (!kUnderAddressSanitizer) {
     EXPECT_LT(last.rss_kb - settled.rss_kb, 2048);
   }
 
-  EXPECT_EQ(request_free_shm(connection), SDS_ERROR_NONE);
+  EXPECT_EQ(sds_client_release_shm(connection), SDS_ERROR_NONE);
   int status = 0;
   ASSERT_TRUE(service.wait_exit(&status));
   EXPECT_EQ(exit_code_of(status), 0) << service.output();
@@ -140,7 +140,7 @@ TEST_F(Soak, ThirtyConnectionsInARowLeaveTheActivatorFlatAndNothingBehind) {
     maps_min = maps_min < 0 ? s.mappings : std::min(maps_min, s.mappings);
     maps_max = std::max(maps_max, s.mappings);
     if (n == 0) first = proc_stats(activator.pid());
-    EXPECT_EQ(request_free_shm(connection), SDS_ERROR_NONE);
+    EXPECT_EQ(sds_client_release_shm(connection), SDS_ERROR_NONE);
   }
   const ProcStats last = proc_stats(activator.pid());
   EXPECT_EQ(failures, 0);

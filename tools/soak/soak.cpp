@@ -8,7 +8,9 @@
 // Not a test: a run takes minutes (tests/soak_test.cpp is the short version).
 #include <fcntl.h>
 #include <poll.h>
+#include <sched.h>
 #include <sqlite3.h>
+#include <sys/mount.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
@@ -30,10 +32,10 @@
 #include "database/sitedeck-service-db-interface.h"
 #include "dlog.h"
 #include "proc_stats.h"
+#include "sitedeck-client-commands.h"
 #include "sitedeck-client.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "support/raw_requests.h"
 
 extern char** environ;
 
@@ -127,6 +129,16 @@ std::set<std::string> files_of(const std::string& root) {
 
 bool shm_object_exists() { return fs::exists(SDS_SHM_FILE_PATH); }
 
+// Other service processes on this machine (tests, demos) make and remove the
+// same machine-wide shared-memory object, which would fail this run's icon
+// requests now and then. A mount namespace with a /dev/shm of its own keeps
+// them apart; it needs root, and without it the shared one is used.
+bool isolate_shared_memory() {
+  return unshare(CLONE_NEWNS) == 0 &&
+         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+         mount("tmpfs", "/dev/shm", "tmpfs", MS_NOSUID | MS_NODEV, "size=64m") == 0;
+}
+
 pid_t spawn(const std::vector<std::string>& argv, int fd3, const std::string& log_path,
             bool activation) {
   std::vector<std::string> env;
@@ -188,23 +200,24 @@ int listen_socket() {
 }
 
 // One request of the mix; false when its reply was not the expected one.
-bool one_request(const SdsConnection& c, long n) {
+bool one_request(SdsConnection& c, long n) {
   const int32_t cmd = kCommands[n % 5];
-  const int32_t id = static_cast<int32_t>(1 + (n / 5) % kItems);
-  std::string text;
-  int32_t value = 0, width = 0, height = 0;
-  std::vector<int32_t> ids;
+  const auto id = static_cast<int32_t>(1 + (n / 5) % kItems);
+  UniqueCStr text;
+  int32_t value = 0;
+  sds_client_icon icon;
+  sds_client_ids ids;
   switch (cmd) {
     case SDS_CMD_GET_URL:
-      return request_text(c, cmd, id, &text) == SDS_ERROR_NONE;
+      return sds_client_get_url(c, id, &text) == SDS_ERROR_NONE;
     case SDS_CMD_GET_TOUCH_ICON_EXISTS:
-      return request_int(c, cmd, id, &value) == SDS_ERROR_NONE && value == 1;
+      return sds_client_get_touch_icon_exists(c, id, &value) == SDS_ERROR_NONE && value == 1;
     case SDS_CMD_GET_ICON:
-      return request_icon(c, id, &value, &width, &height) == SDS_ERROR_NONE && value == 12996;
+      return sds_client_get_icon(c, id, &icon) == SDS_ERROR_NONE && icon.byte_count == 12996;
     case SDS_CMD_GET_NEXT_UPDATE_DURATION:
-      return request_next_update(c, &value) == SDS_ERROR_NONE && value == 3600;
+      return sds_client_get_next_update_duration(c, &value) == SDS_ERROR_NONE && value == 3600;
     default:
-      return request_ids(c, &ids) == SDS_ERROR_NONE && ids.size() == kItems;
+      return sds_client_get_ids_by_dirty(c, 1, &ids) == SDS_ERROR_NONE && ids.count == kItems;
   }
 }
 
@@ -244,7 +257,7 @@ bool one_connection(const Options& o, const std::string& root) {
   }
   double seconds =
       std::chrono::duration<double>(std::chrono::steady_clock::now() - started).count();
-  const bool freed = request_free_shm(c) == SDS_ERROR_NONE;
+  const bool freed = sds_client_release_shm(c) == SDS_ERROR_NONE;
   c.close();
   int status = 0;
   const bool ended = wait_for(service, 10000, &status);
@@ -306,7 +319,7 @@ bool many_connections(const Options& o, const std::string& root) {
       if (n == 0) first_activator = last_activator;
       print_row("activator", n, last_activator);
     }
-    if (request_free_shm(c) != SDS_ERROR_NONE) ++failures;
+    if (sds_client_release_shm(c) != SDS_ERROR_NONE) ++failures;
   }
   double seconds =
       std::chrono::duration<double>(std::chrono::steady_clock::now() - started).count();
@@ -341,10 +354,12 @@ int main(int argc, char** argv) {
   Options o;
   if (!parse(argc, argv, &o)) return 2;
   std::signal(SIGPIPE, SIG_IGN);
+  const bool isolated = isolate_shared_memory();
   const std::string root = make_root();
   const std::set<std::string> before = files_of(root);
   const bool shm_before = shm_object_exists();
-  std::printf("scratch root %s\n", root.c_str());
+  std::printf("scratch root %s; %s\n", root.c_str(),
+              isolated ? "a /dev/shm of its own" : "the machine's /dev/shm (not root)");
 
   bool ok = one_connection(o, root);
   ok = many_connections(o, root) && ok;
