@@ -22,16 +22,21 @@ constexpr bench_group kGroups[] = {
     {"queries", bench_group_queries},
     {"deck", bench_group_deck},
     {"pull", bench_group_pull},
+    {"startup", bench_group_startup},
 };
 
 void usage(FILE* out) {
   std::fprintf(out,
                "usage: sitedeck_bench [--quick] [--verbose] [--only GROUP] [--json FILE]\n"
+               "                      [--service LABEL=PATH]...\n"
                "  --quick       few iterations: a smoke run\n"
                "  --verbose     show the client library's log lines\n"
                "  --only GROUP  run one group:");
   for (const auto& group : kGroups) std::fprintf(out, " %s", group.name);
-  std::fprintf(out, "\n  --json FILE   also write the results as JSON to FILE\n");
+  std::fprintf(out,
+               "\n  --json FILE   also write the results as JSON to FILE\n"
+               "  --service LABEL=PATH  also measure the service binary at PATH (another\n"
+               "                build, with its pull module beside it), as \"scenario@LABEL\"\n");
 }
 
 }  // namespace
@@ -39,6 +44,7 @@ void usage(FILE* out) {
 int main(int argc, char** argv) {
   (void)signal(SIGPIPE, SIG_IGN);
   bench_options options;
+  options.services.push_back({"", std::string(SITEDECK_BIN_DIR) + "/browser-sitedeck-service"});
   for (int i = 1; i < argc; ++i) {
     if (std::strcmp(argv[i], "--quick") == 0) {
       options.quick = true;
@@ -48,6 +54,11 @@ int main(int argc, char** argv) {
       options.verbose = true;
     } else if (std::strcmp(argv[i], "--json") == 0 && i + 1 < argc) {
       options.json_path = argv[++i];
+    } else if (std::strcmp(argv[i], "--service") == 0 && i + 1 < argc &&
+               std::strchr(argv[i + 1], '=') != nullptr && argv[i + 1][0] != '=') {
+      std::string spec = argv[++i];
+      size_t equals = spec.find('=');
+      options.services.push_back({spec.substr(0, equals), spec.substr(equals + 1)});
     } else {
       usage(argv[i][1] == 'h' || std::strcmp(argv[i], "--help") == 0 ? stdout : stderr);
       return std::strcmp(argv[i], "--help") == 0 ? 0 : 2;

@@ -2,8 +2,8 @@
 // systemd journal with structured fields, and to a test sink.
 #include "dlog.h"
 
+#include <dlfcn.h>
 #include <sys/stat.h>
-#include <systemd/sd-journal.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -54,6 +54,21 @@ bool stderr_is_journal() {
   return st.st_dev == dev && st.st_ino == ino;
 }
 
+using journal_send_fn = int (*)(const char* format, ...);
+
+// sd_journal_send, from libsystemd loaded when the first line goes to the
+// journal: a process that logs to a plain stream (or not at all) does not
+// pay for loading that library and the seven it needs at every start.
+// Null when it cannot be had; the line then goes to standard error only.
+journal_send_fn journal_send() {
+  static const journal_send_fn send = [] {
+    void* library = dlopen("libsystemd.so.0", RTLD_NOW | RTLD_LOCAL);
+    return library != nullptr ? reinterpret_cast<journal_send_fn>(dlsym(library, "sd_journal_send"))
+                              : nullptr;
+  }();
+  return send;
+}
+
 // The service formats lines as "file: function(line) > message"; pull the three
 // code fields back out for the journal.
 void send_to_journal(int prio, const char* tag, const std::string& text) {
@@ -66,7 +81,9 @@ void send_to_journal(int prio, const char* tag, const std::string& text) {
     func = text.substr(colon + 2, paren - colon - 2);
     line = text.substr(paren + 1, close - paren - 1);
   }
-  (void)sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journal_priority(prio),
+  journal_send_fn send = journal_send();
+  if (send == nullptr) return;
+  (void)send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journal_priority(prio),
                         "SYSLOG_IDENTIFIER=%s", tag, "CODE_FILE=%s", file.c_str(),
                         "CODE_LINE=%s", line.c_str(), "CODE_FUNC=%s", func.c_str(), nullptr);
 }

@@ -6,7 +6,6 @@
 #include <glib.h>
 #include <pthread.h>
 #include <sys/socket.h>
-#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -15,6 +14,7 @@
 #include <new>
 #include <string>
 
+#include "sitedeck-service-activation.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-main.h"
 #include "sitedeck-service-paths.h"
@@ -44,10 +44,10 @@ std::atomic<sds_server_context*> g_context{nullptr};
 // A result of 0 (a socket, but not listening at our path) is accepted too:
 // the activation unit decides what it hands over.
 int __sds_accept_socket(void) {
-  int count = sd_listen_fds(1);
+  int count = sds_listen_fds(1);
   std::string path = sds_path(SDS_SOCKET_PATH);
-  for (int fd = SD_LISTEN_FDS_START; count > 0 && fd < SD_LISTEN_FDS_START + count; ++fd) {
-    if (sd_is_socket_unix(fd, SOCK_STREAM, 1, path.c_str(), 0) >= 0) {
+  for (int fd = SDS_LISTEN_FDS_START; count > 0 && fd < SDS_LISTEN_FDS_START + count; ++fd) {
+    if (sds_is_socket_unix(fd, SOCK_STREAM, 1, path.c_str()) >= 0) {
       SDS_LOGI("listen systemd socket:%d", fd);
       return fd;
     }
@@ -93,6 +93,9 @@ int main() {
       std::signal(SIGPIPE, SIG_IGN) == SIG_ERR) {
     SDS_LOGE("failed to register signal callback");
   }
+  // A file that reaches the size limit (a full quota) must fail its write
+  // with EFBIG, which every writer handles, rather than end the process.
+  (void)std::signal(SIGXFSZ, SIG_IGN);
 
   auto* context = new (std::nothrow) sds_server_context{};
   if (context == nullptr) {

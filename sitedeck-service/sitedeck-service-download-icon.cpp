@@ -55,8 +55,16 @@ size_t write_icon_block(char* data, size_t size, size_t count, void* user) {
 struct IconTransfer {
   sds_icon* icon = nullptr;
   IconSink sink;
+  std::string path;      // the icon's file, once it was made
   bool ok = false;
 };
+
+// The file of a transfer that did not complete goes, so that no partial icon
+// is left in the images directory.
+void drop_partial_file(IconTransfer* t) {
+  t->sink.file.reset();
+  if (!t->ok && !t->path.empty()) (void)std::remove(t->path.c_str());
+}
 
 // Checks a finished transfer the way a single download is judged, and
 // closes its file.
@@ -147,10 +155,11 @@ bool IconFetcher::start(IconTransfer* t) {
     give_back(curl);
     return false;
   }
+  t->path = path.get();
   (void)curl_easy_setopt(curl, CURLOPT_URL, t->icon->icon_path);
   (void)curl_easy_setopt(curl, CURLOPT_WRITEDATA, &t->sink);
   if (curl_multi_add_handle(multi_.get(), curl) != CURLM_OK) {
-    t->sink.file.reset();
+    drop_partial_file(t);
     give_back(curl);
     return false;
   }
@@ -179,7 +188,7 @@ void IconFetcher::run(const std::vector<IconTransfer*>& transfers) {
       IconTransfer* t = found->second;
       running_.erase(found);
       t->ok = finish_transfer(curl, &t->sink, msg->data.result);
-      t->sink.file.reset();
+      drop_partial_file(t);
       (void)curl_multi_remove_handle(multi_.get(), curl);
       give_back(curl);
     }
@@ -189,7 +198,7 @@ void IconFetcher::run(const std::vector<IconTransfer*>& transfers) {
   }
   // Left running only when the multi interface failed: those did not complete.
   for (auto& [curl, t] : running_) {
-    t->sink.file.reset();
+    drop_partial_file(t);
     (void)curl_multi_remove_handle(multi_.get(), curl);
     give_back(curl);
   }

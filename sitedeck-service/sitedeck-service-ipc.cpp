@@ -5,6 +5,7 @@
 #include "sitedeck-service-ipc.h"
 
 #include <sys/socket.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -245,6 +246,42 @@ int sds_ipc_send_custom_type(int sock, const void* buffer, size_t length) {
     return -1;
   }
   return __sds_ipc_write_item(sock, buffer, length);
+}
+
+int sds_ipc_send_reply(int sock, const struct iovec* items, int count) {
+  constexpr int kMaxItems = 8;
+  if (sock < 0 || items == nullptr || count < 1 || count > kMaxItems) return 0;
+  struct iovec rest[kMaxItems];
+  std::memcpy(rest, items, sizeof(struct iovec) * static_cast<size_t>(count));
+  struct iovec* next = rest;
+  bool sent_any = false;
+  while (count > 0) {
+    struct msghdr message {};
+    message.msg_iov = next;
+    message.msg_iovlen = static_cast<size_t>(count);
+    ssize_t written = sendmsg(sock, &message, MSG_NOSIGNAL);
+    if (written < 0 && errno == ENOTSOCK) written = writev(sock, next, count);
+    // Once part of the reply is out, the rest must follow it.
+    if (written < 0 && errno == EINTR && sent_any) continue;
+    if (written <= 0) {
+      if (!sent_any) return 0;
+      SDS_LOGE("[IPC.Write] exception sock:%d [%s]", sock, strerror(errno));
+      return -1;
+    }
+    sent_any = true;
+    // A blocking socket sends everything unless a signal cut it short.
+    auto left = static_cast<size_t>(written);
+    while (count > 0 && left >= next->iov_len) {
+      left -= next->iov_len;
+      ++next;
+      --count;
+    }
+    if (count > 0) {
+      next->iov_base = static_cast<char*>(next->iov_base) + left;
+      next->iov_len -= left;
+    }
+  }
+  return 1;
 }
 
 int sds_ipc_read_blob(int sock, void* buffer, size_t size) {

@@ -6,6 +6,8 @@
 // sds_ipc_read_blob). The primitives keep no state and never close the socket.
 #pragma once
 
+#include <sys/uio.h>
+
 #include <cstddef>
 
 #include "sitedeck-service-types.h"
@@ -37,3 +39,11 @@ int sds_ipc_simple_response(int sock, const sds_command* command);
 
 // The constant name of an SDS code; "SDS_ERROR_UNKNOWN" for codes without one.
 const char* sds_error_string(int code);
+
+// Sends the items of one reply in one system call: the same bytes, back to
+// back, that writing them one by one would put on the wire, with one wake-up
+// of the peer instead of one per item. Returns 1 when all went out; 0 when
+// nothing did, nothing being logged (the caller writes the items one by one
+// instead, each failing and logging as it does); -1 when the reply stopped
+// part-way, after "[IPC.Write] exception sock:%d [%s]".
+[[nodiscard]] int sds_ipc_send_reply(int sock, const struct iovec* items, int count);

@@ -136,8 +136,17 @@ int sds_main_thread(sds_server_context* context) {
   (void)pthread_detach(client->thread);
 
   // The worker only reads from here on, so writing the handshake is safe.
-  if (sds_ipc_send_errorcode(sock, SDS_ERROR_NONE) != 0) return -1;
-  if (sds_ipc_send_custom_type(sock, &id, sizeof id) != 0) return -1;
+  // Status and id go out in one write, which wakes the client once; should
+  // that fail, they are written one by one as ever.
+  const int32_t status = SDS_ERROR_NONE;
+  const struct iovec handshake[] = {{const_cast<int32_t*>(&status), sizeof status},
+                                    {&id, sizeof id}};
+  int sent = sds_ipc_send_reply(sock, handshake, 2);
+  if (sent < 0) return -1;
+  if (sent == 0) {
+    if (sds_ipc_send_errorcode(sock, SDS_ERROR_NONE) != 0) return -1;
+    if (sds_ipc_send_custom_type(sock, &id, sizeof id) != 0) return -1;
+  }
   SDS_LOGW("sds_main_thread end");
   return 0;
 }

@@ -8,9 +8,8 @@
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
+#include "sitedeck-service-pull.h"
 #include "sitedeck-service-request-handler-internal.h"
-#include "sitedeck-service-request-server.h"
-#include "sitedeck-service-utils.h"
 
 namespace {
 
@@ -62,11 +61,16 @@ int _initialize(int sock) {
     SDS_LOGE("Invalid Location data: latitude = %lf longitude = %lf", latitude, longitude);
   }
 
-  int result = sds_check_data_pull_required(args.get());
+  // Without the pull's code there is no pull to run.
+  const sds_pull_calls* pull = sds_pull_get_calls();
+  int result = pull != nullptr ? pull->check_data_pull_required(args.get())
+                               : SDS_ERROR_DATA_PULL_FAILED;
   if (sds_ipc_send_errorcode(sock, result) != 0) {
     // The browser never learnt the outcome: make its next pull a full one.
-    (void)remove_file(sds_path(SDS_ETAG_PATH).c_str());
-    sds_set_next_update_duration(SDS_DEFAULT_UPDATE_SECONDS);
+    if (pull != nullptr) {
+      (void)pull->remove_file(sds_path(SDS_ETAG_PATH).c_str());
+      pull->set_next_update_duration(SDS_DEFAULT_UPDATE_SECONDS);
+    }
     return SDS_ERROR_IO_ERROR;
   }
   return result;

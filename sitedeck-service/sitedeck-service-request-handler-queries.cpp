@@ -1,9 +1,17 @@
 // Handlers of the browser's item queries (commands 2 to 11): each reads what
 // the command carries, asks the item store and writes the reply. The reply
-// layouts are fixed by the wire protocol (docs/protocol.md).
+// layouts are fixed by the wire protocol (docs/protocol.md). A reply of
+// several items goes out in one write when it can: the browser waits for the
+// last item, and a write per item woke it once per item. Should that write
+// fail, the items are written one by one as before, so that a peer that has
+// gone away sees the same failures, and the log the same lines.
+#include <sys/uio.h>
+
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <initializer_list>
 
 #include "database/sitedeck-service-db-interface.h"
 #include "sitedeck-service-ipc.h"
@@ -18,6 +26,35 @@ namespace {
 // The duration file holds a short decimal number; more is not a duration.
 constexpr long kMaxDurationFileBytes = 64;
 
+// Writes a whole reply in one go. False when nothing of it could be written:
+// the caller then writes the items one by one.
+bool __sds_reply_at_once(int sock, std::initializer_list<struct iovec> items) {
+  return sds_ipc_send_reply(sock, items.begin(), static_cast<int>(items.size())) != 0;
+}
+
+struct iovec __sds_item(const void* data, size_t length) {
+  return {const_cast<void*>(data), length};
+}
+
+// Command 7's way with the pixels: straight from the store into the shared
+// memory, which is mapped once for the connection.
+struct icon_delivery {
+  bool too_big = false;
+  bool unmapped = false;
+};
+
+unsigned char* __sds_place_icon(int length, void* user) {
+  auto* delivery = static_cast<icon_delivery*>(user);
+  // The object holds SDS_SHM_SIZE bytes; a bigger icon cannot be handed over.
+  if (length < 0 || static_cast<size_t>(length) > SDS_SHM_SIZE) {
+    delivery->too_big = true;
+    return nullptr;
+  }
+  void* mapping = sds_shm_kept_mapping();
+  if (mapping == nullptr) delivery->unmapped = true;
+  return static_cast<unsigned char*>(mapping);
+}
+
 }  // namespace
 
 int _sds_get_string(int sock, int item_id, const char* column) {
@@ -28,6 +65,18 @@ int _sds_get_string(int sock, int item_id, const char* column) {
   char* text = nullptr;
   int code = sds_get_string_from_db(item_id, &text, column);
   UniqueCStr owned(text);
+  if (code == SDS_ERROR_NONE && owned) {
+    size_t length = std::strlen(owned.get());
+    const int32_t status = SDS_ERROR_NONE;
+    const auto wire_length = static_cast<int32_t>(length);
+    // A text the string item can't carry goes the long way, which refuses it.
+    if (length > 0 && length <= SDS_IPC_STRING_MAX &&
+        __sds_reply_at_once(sock, {__sds_item(&status, sizeof status),
+                                   __sds_item(&wire_length, sizeof wire_length),
+                                   __sds_item(owned.get(), length)})) {
+      return code;
+    }
+  }
   (void)sds_ipc_send_errorcode(sock, code);
   if (code == SDS_ERROR_NONE) (void)sds_ipc_send_string(sock, owned.get());
   return code;
@@ -41,6 +90,12 @@ int _sds_get_int(int sock, int item_id, const char* column) {
   sds_db_value value{};
   value.i64 = 0;
   int code = sds_get_int_from_db(item_id, &value, column);
+  const int32_t status = SDS_ERROR_NONE;
+  if (code == SDS_ERROR_NONE &&
+      __sds_reply_at_once(sock, {__sds_item(&status, sizeof status),
+                                 __sds_item(&value.i32, sizeof value.i32)})) {
+    return code;
+  }
   (void)sds_ipc_send_errorcode(sock, code);
   if (code == SDS_ERROR_NONE) (void)sds_ipc_send_custom_type(sock, &value.i32, sizeof value.i32);
   return code;
@@ -52,30 +107,25 @@ int _sds_get_blob(int sock, int item_id) {
     return SDS_ERROR_INVALID_PARAMETER;
   }
   int length = 0, height = 0, width = 0;
-  unsigned char* bytes = nullptr;
-  int code = sds_get_blob_from_db(item_id, &length, &height, &width, &bytes);
-  UniqueMalloc<unsigned char> pixels(bytes);
+  icon_delivery delivery;
+  int code =
+      sds_copy_blob_from_db(item_id, &length, &height, &width, __sds_place_icon, &delivery);
   if (code != SDS_ERROR_NONE) {
     SDS_LOGE("[CRITICAL]  No Data");
     (void)sds_ipc_send_errorcode(sock, SDS_ERROR_NO_DATA);
     return code;
   }
-  // The object holds SDS_SHM_SIZE bytes; a bigger icon cannot be handed over.
-  if (length < 0 || static_cast<size_t>(length) > SDS_SHM_SIZE) {
+  if (delivery.too_big) {
     SDS_LOGE("[CRITICAL] icon of %d bytes does not fit the shared memory", length);
     (void)sds_ipc_send_errorcode(sock, SDS_ERROR_SHM_FAILED);
     return SDS_ERROR_NONE;
   }
-  void* mapping = sds_attach_shm();
-  if (mapping == nullptr) {
+  if (delivery.unmapped) {
     (void)sds_ipc_send_errorcode(sock, SDS_ERROR_SHM_FAILED);
     return SDS_ERROR_NONE;
   }
-  std::memcpy(mapping, pixels.get(), static_cast<size_t>(length));
-  if (sds_dettach_shm(mapping) != 1) {
-    (void)sds_ipc_send_errorcode(sock, SDS_ERROR_SHM_FAILED);
-    return SDS_ERROR_NONE;
-  }
+  const int32_t reply[4] = {SDS_ERROR_NONE, length, width, height};
+  if (__sds_reply_at_once(sock, {__sds_item(reply, sizeof reply)})) return SDS_ERROR_NONE;
   if (sds_ipc_send_errorcode(sock, SDS_ERROR_NONE) == 0 &&
       sds_ipc_send_custom_type(sock, &length, sizeof length) == 0 &&
       sds_ipc_send_custom_type(sock, &width, sizeof width) == 0) {
@@ -86,6 +136,7 @@ int _sds_get_blob(int sock, int item_id) {
 
 int _sds_release_shm(sds_client* slot) {
   if (sds_free_shm() == 1) {
+    sds_shm_drop_kept_mapping();
     (void)sds_ipc_send_errorcode(slot->sock, SDS_ERROR_NONE);
     slot->client_id = -1;
     return SDS_ERROR_NONE;
@@ -122,6 +173,8 @@ int _sds_get_next_update_duration(int sock) {
       }
     }
   }
+  const int32_t reply[2] = {SDS_ERROR_NONE, seconds};
+  if (__sds_reply_at_once(sock, {__sds_item(reply, sizeof reply)})) return SDS_ERROR_NONE;
   (void)sds_ipc_send_errorcode(sock, SDS_ERROR_NONE);
   (void)sds_ipc_send_custom_type(sock, &seconds, sizeof seconds);
   return SDS_ERROR_NONE;
@@ -159,6 +212,13 @@ int _sds_get_full_ids(int sock) {
                                    SDS_DB_COND_TYPE_INT);
   }
   UniqueMalloc<int> owned_ids(ids);
+  const int32_t head[2] = {SDS_ERROR_NONE, count};
+  if (code == SDS_ERROR_NONE && count > 0 && owned_ids &&
+      __sds_reply_at_once(sock, {__sds_item(head, sizeof head),
+                                 __sds_item(owned_ids.get(),
+                                            static_cast<size_t>(count) * sizeof(int))})) {
+    return code;
+  }
   (void)sds_ipc_send_errorcode(sock, code);
   if (code == SDS_ERROR_NONE) {
     (void)sds_ipc_send_custom_type(sock, &count, sizeof count);

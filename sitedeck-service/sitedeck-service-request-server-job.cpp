@@ -7,6 +7,7 @@
 #include <cmath>
 #include <cstdlib>
 
+#include "database/sitedeck-service-db-interface.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-request-server.h"
@@ -58,6 +59,9 @@ void sds_free_server_list(sds_server_list** head) {
 int sds_check_data_pull_required(sds_server_req_args* args) {
   int result = SDS_ERROR_DATA_PULL_FAILED;
   sds_transfer_global_init();
+  // A damaged database would keep its damage for good: a 304 answer leaves
+  // it as it is and a merge into it fails. Made afresh, this pull refills it.
+  (void)sds_ensure_db_sound();
 
   if (args != nullptr && valid_position(args) && sds_get_city_and_province(args) != 0) {
     std::free(args->province);

@@ -266,6 +266,12 @@ int sds_download_and_parse_json_data(const char* url) {
         SDS_LOGE("Unable to open file = %s", etag_path.c_str());
       }
     }
+    // The table still holds the previous list (locked, read-only or full
+    // database): the browser must not be told the pull succeeded.
+    if (merged == SDS_MERGE_NOT_COMMITTED && sds_last_error == SDS_ERROR_HTTP_OK) {
+      SDS_LOGE("the item list could not be stored");
+      sds_last_error = SDS_ERROR_DISK_BUSY;
+    }
     sds_free_item_list();
   }
   (void)std::remove(pending_etag_path.c_str());

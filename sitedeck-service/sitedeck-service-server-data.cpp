@@ -1,14 +1,22 @@
 // The server list: the content servers a data pull may ask, read from the
 // installed XML file in file order, logged, and one server's base URL
-// rewritten in place when that server has moved permanently. The file is left
-// byte-for-byte alone unless a server's URL actually changes.
+// rewritten when that server has moved permanently. The file is left
+// byte-for-byte alone unless a server's URL actually changes, and is only
+// ever replaced whole.
 #include "sitedeck-service-server-data.h"
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
+#include <string>
 
 #include "sitedeck-service-log.h"
+#include "sitedeck-service-raii.h"
 #include "sitedeck-service-xml-read.h"
 
 namespace {
@@ -83,6 +91,27 @@ bool __server_has_id(xmlNode* server, int id) {
   return false;
 }
 
+// Replaces the file at `path` with `doc` as a whole: the document is written
+// beside it and renamed over it once it is complete on disk, so a full disk
+// or a crash in the middle leaves the old list, never a cut one (without a
+// server list no pull can run again). 0, or -1 with the old file in place.
+int __save_whole(const char* path, xmlDoc* doc) {
+  const std::string temp = std::string(path) + ".new";
+  int written = xmlSaveFileEnc(temp.c_str(), doc, "UTF-8");
+  struct stat st {};
+  bool whole = written >= 0 && stat(temp.c_str(), &st) == 0 && st.st_size == written;
+  if (whole) {
+    UniqueFd fd(open(temp.c_str(), O_RDONLY | O_CLOEXEC));
+    whole = fd && fsync(fd.get()) == 0;
+  }
+  if (!whole || rename(temp.c_str(), path) != 0) {
+    SDS_LOGE("[CRITICAL] %s could not be rewritten [%s]", path, strerror(errno));
+    (void)unlink(temp.c_str());
+    return -1;
+  }
+  return 0;
+}
+
 }  // namespace
 
 sds_server_list* sds_get_server_data(const char* path) {
@@ -152,6 +181,6 @@ int sds_update_base_url(const char* path, int id, const char* new_base_url) {
   for (xmlNode* child = match->children; child != nullptr; child = child->next) {
     if (sds_xml_is_element(child, "Base-url")) xmlNodeSetContent(child, escaped.get());
   }
-  (void)xmlSaveFileEnc(path, doc.get(), "UTF-8");  // a failed save is not reported
+  (void)__save_whole(path, doc.get());  // a failed save leaves the old list
   return 0;
 }

@@ -3,6 +3,9 @@
 // since the browser opens it by that name, so it is never moved below
 // $SITEDECK_ROOT. No descriptor outlives a call: a mapping stays valid without
 // one, and a long connection with many icon requests must not pile them up.
+// The icon requests share one mapping, kept for as long as the name leads to
+// the object it maps: opening and mapping the object for every icon cost
+// several times the copy of the icon itself.
 #include "sitedeck-service-shm.h"
 
 #include <fcntl.h>
@@ -123,6 +126,34 @@ void __sds_log_map_error(int err) {
   }
 }
 
+// The mapping the icon requests share, and the object it maps.
+struct kept_mapping {
+  void* address = nullptr;
+  dev_t device = 0;
+  ino_t inode = 0;
+};
+kept_mapping g_kept;
+
+// Opens the object by name and maps all of it, logging failures as
+// sds_attach_shm does; `object` gets the object's identity.
+void* __sds_map_object(struct stat* object) {
+  UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDWR, 0660));
+  if (!fd) {
+    __sds_log_attach_open_error(errno);
+    return nullptr;
+  }
+  void* address = mmap(nullptr, SDS_SHM_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, fd.get(), 0);
+  if (address == MAP_FAILED) {
+    int err = errno;
+    std::puts("Map failed");
+    (void)std::fflush(stdout);
+    __sds_log_map_error(err);
+    return nullptr;
+  }
+  if (object != nullptr && fstat(fd.get(), object) != 0) *object = {};
+  return address;
+}
+
 // Hands the object to the browser's account. A system without that account
 // (a development machine) keeps the creator as owner; the 0666 mode still lets
 // every local process in.
@@ -166,21 +197,28 @@ int sds_free_shm(void) {
   return 1;
 }
 
-void* sds_attach_shm(void) {
-  UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDWR, 0660));
-  if (!fd) {
-    __sds_log_attach_open_error(errno);
-    return nullptr;
+void* sds_attach_shm(void) { return __sds_map_object(nullptr); }
+
+void* sds_shm_kept_mapping(void) {
+  struct stat named {};
+  if (g_kept.address != nullptr && stat(SDS_SHM_FILE_PATH, &named) == 0 &&
+      named.st_dev == g_kept.device && named.st_ino == g_kept.inode) {
+    return g_kept.address;
   }
-  void* address = mmap(nullptr, SDS_SHM_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, fd.get(), 0);
-  if (address == MAP_FAILED) {
-    int err = errno;
-    std::puts("Map failed");
-    (void)std::fflush(stdout);
-    __sds_log_map_error(err);
-    return nullptr;
-  }
+  // Removed or made anew by someone else: map what the name leads to now,
+  // as a fresh attach for this request would.
+  sds_shm_drop_kept_mapping();
+  struct stat object {};
+  void* address = __sds_map_object(&object);
+  // An object whose identity fstat could not tell never matches the name,
+  // so its mapping is made anew (and this one unmapped) next time.
+  if (address != nullptr) g_kept = {address, object.st_dev, object.st_ino};
   return address;
+}
+
+void sds_shm_drop_kept_mapping(void) {
+  if (g_kept.address != nullptr) (void)munmap(g_kept.address, SDS_SHM_SIZE);
+  g_kept = {};
 }
 
 int sds_dettach_shm(void* address) {

@@ -225,3 +225,80 @@ TEST(DbErrorCode, MapsTheConnectionsLastResult) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST(DbOpen, EmptyFileWasNeverGivenTheTable) {
+  // What a first start leaves when the disk is full or the process dies
+  // between creating the file and writing the table.
+  DbSession db(false);
+  ASSERT_TRUE(write_file(db.db_path(), ""));
+  EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_EQ(__check_table(sds_db_handle, "site_deck"), 0);
+  EXPECT_EQ(db.rows("SELECT count(*) FROM site_deck"), "0");
+}
+
+TEST(DbOpen, StoredEtagOutlivedTheItemsSoTheNextPullWasAnsweredNotModified) {
+  const struct {
+    const char* name;
+    const char* setup_sql;  // null: no file; "garbage": not a database
+    bool etag_kept;
+  } cases[] = {
+      {"no database file", nullptr, false},
+      {"a file that is no database", "garbage", false},
+      {"a table without rows", kTableSql, false},
+      {"a table with rows", "", true},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    DbSession db(false);
+    if (c.setup_sql != nullptr && std::string(c.setup_sql) == "garbage") {
+      ASSERT_TRUE(write_file(db.db_path(), std::string(8192, 'g')));
+    } else if (c.setup_sql != nullptr) {
+      sqlite3* other = nullptr;
+      ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &other), SQLITE_OK);
+      std::string sql = c.setup_sql[0] != '\0'
+                            ? std::string(c.setup_sql)
+                            : std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')";
+      ASSERT_EQ(sqlite3_exec(other, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
+      sqlite3_close(other);
+    }
+    const std::string etag = db.root().path(SDS_ETAG_PATH);
+    ASSERT_TRUE(write_file(etag, "\"v1\"\r\n"));
+    LogCapture log;
+    EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+    EXPECT_EQ(file_exists(etag), c.etag_kept);
+    EXPECT_EQ(log.contains("no items stored: the stored ETag is dropped"), !c.etag_kept);
+  }
+}
+
+TEST(DbSound, DamagedPageOfAnOpenedDatabaseWasKeptForGood) {
+  DbSession db;
+  ASSERT_TRUE(
+      db.exec("INSERT INTO site_deck(url, icon_data) VALUES ('https://a.example/', "
+              "randomblob(20000)), ('https://b.example/', randomblob(20000))"));
+  DbSession::close_handle();
+  // Damage past the first pages: opening the file does not notice it.
+  std::string content = read_file(db.db_path());
+  ASSERT_GT(content.size(), 16384u);
+  content.replace(8192, 4096, std::string(4096, 'Z'));
+  ASSERT_TRUE(write_file(db.db_path(), content));
+  const std::string etag = db.root().path(SDS_ETAG_PATH);
+  ASSERT_TRUE(write_file(etag, "\"v1\"\r\n"));
+  ASSERT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  EXPECT_TRUE(file_exists(etag));
+
+  LogCapture log;
+  EXPECT_EQ(sds_ensure_db_sound(), SDS_ERROR_NONE);
+  EXPECT_TRUE(log.contains("database is damaged: it is made afresh"));
+  EXPECT_EQ(db.rows("SELECT count(*) FROM site_deck"), "0");
+  EXPECT_EQ(db.rows("PRAGMA integrity_check"), "ok");
+  EXPECT_FALSE(file_exists(etag));
+
+  // A sound database is left as it is.
+  ASSERT_TRUE(db.exec("INSERT INTO site_deck(url) VALUES ('https://c.example/')"));
+  EXPECT_EQ(sds_ensure_db_sound(), SDS_ERROR_NONE);
+  EXPECT_EQ(db.rows("SELECT url FROM site_deck"), "https://c.example/");
+}
+
+}  // namespace

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "database/sitedeck-service-db-interface.h"
 #include "kdb.h"
 #include "sitedeck-client.h"
 #include "sitedeck-service-ipc.h"
@@ -159,6 +160,11 @@ TEST_F(Initialize, ClientGoneBeforeTheResultDropsTheEtagAndAsksAgainInADay) {
   // lost result can remove it.
   const std::string etag = http_get(content_.signed_url("platform=Valto&")).header("ETag");
   ASSERT_FALSE(etag.empty());
+  // The ETag names a stored list; without any stored item it would be dropped.
+  ASSERT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
+  ASSERT_TRUE(
+      DbSession::exec("INSERT INTO site_deck(url) VALUES ('http://daily-herald.example/')"));
+  DbSession::close_handle();
   ASSERT_TRUE(write_file(sds_path(SDS_ETAG_PATH), etag + "\r\n"));
   // The answer waits long enough for the client to be gone.
   ASSERT_TRUE(content_.control({{"delay_ms", "1000"}}));

@@ -326,3 +326,42 @@ TEST_F(Merge, MergeCutInHalfIsNeverSeenAndNeverLeftBehind) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST_F(Merge, FailedRowWritesWereCommittedAsIfTheListWasStored) {
+  // Triggers make the writes fail as a disk that turned read-only would.
+  const struct {
+    const char* name;
+    const char* trigger;
+    const char* message;
+  } cases[] = {
+      {"insert fails",
+       "CREATE TRIGGER fail BEFORE INSERT ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END",
+       "a row of the list could not be written"},
+      {"renumbering fails",
+       "CREATE TRIGGER fail BEFORE UPDATE OF order_index ON site_deck BEGIN "
+       "SELECT RAISE(ABORT, 'no'); END",
+       "a row of the list could not be written"},
+      {"delete fails",
+       "CREATE TRIGGER fail BEFORE DELETE ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END",
+       "Not able to delete one URL"},
+  };
+  add_item(kA, "A");
+  add_item(kB, "B");
+  ASSERT_EQ(merge(), 0);
+  const std::string before = db_.rows("SELECT * FROM site_deck ORDER BY id");
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    ASSERT_TRUE(db_.exec(c.trigger));
+    add_item(kC, "C");
+    add_item(kA, "A");
+    LogCapture log;
+    EXPECT_EQ(merge(), SDS_MERGE_NOT_COMMITTED);
+    EXPECT_TRUE(log.contains(c.message));
+    ASSERT_TRUE(db_.exec("DROP TRIGGER fail"));
+    EXPECT_EQ(db_.rows("SELECT * FROM site_deck ORDER BY id"), before);
+  }
+}
+
+}  // namespace

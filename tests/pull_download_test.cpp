@@ -249,7 +249,7 @@ TEST_F(PullDownload, EtagOfAListTheMergeRolledBackWasKept) {
   sqlite3* writer = nullptr;
   ASSERT_EQ(sqlite3_open(db_.db_path().c_str(), &writer), SQLITE_OK);
   ASSERT_EQ(sqlite3_exec(writer, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr), SQLITE_OK);
-  EXPECT_EQ(pull(), SDS_ERROR_NONE);
+  EXPECT_EQ(pull(), SDS_ERROR_DISK_BUSY);
   (void)sqlite3_exec(writer, "ROLLBACK", nullptr, nullptr, nullptr);
   sqlite3_close(writer);
   EXPECT_EQ(table(), before);

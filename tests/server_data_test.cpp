@@ -1,6 +1,9 @@
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 
+#include <csignal>
 #include <cstdlib>
+#include <filesystem>
 #include <string>
 #include <vector>
 
@@ -167,6 +170,41 @@ TEST_F(ServerDataTest, RewriteOfAnUnusableFileFails) {
   EXPECT_EQ(read_file(path_), "<list/>");
   EXPECT_EQ(sds_update_base_url(root_.path("/absent.xml").c_str(), 1, "u"), -1);
   EXPECT_TRUE(log.contains("[CRITICAL] " + root_.path("/absent.xml") + " server file not found"));
+}
+
+// Runs `step` with writes limited to `bytes` per file, as on a full disk;
+// SIGXFSZ is ignored meanwhile so that a write past the limit just fails.
+template <typename Step>
+void with_file_size_limit(rlim_t bytes, Step step) {
+  struct rlimit saved {};
+  ASSERT_EQ(getrlimit(RLIMIT_FSIZE, &saved), 0);
+  struct rlimit limited = saved;
+  limited.rlim_cur = bytes;
+  auto* previous = std::signal(SIGXFSZ, SIG_IGN);
+  ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &limited), 0);
+  step();
+  ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &saved), 0);
+  std::signal(SIGXFSZ, previous);
+}
+
+TEST_F(ServerDataTest, RewriteCutShortByAFullDiskLostTheWholeServerList) {
+  const std::string original =
+      values(server("<Id>1</Id><Base-url>https://a.example/list</Base-url>") +
+             server("<Id>2</Id><Base-url>https://b.example/list</Base-url>"));
+  ASSERT_TRUE(write_file(path_, original));
+  with_file_size_limit(
+      64, [&] { (void)sds_update_base_url(path_.c_str(), 1, "https://moved.example/list"); });
+  // The list as it was, and no half-written file beside it.
+  EXPECT_EQ(read_file(path_), original);
+  sds_server_list* head = sds_get_server_data(path_.c_str());
+  EXPECT_EQ(fields(head), (std::vector<ServerFields>{{"https://a.example/list", 1, 0, 0, 0},
+                                                     {"https://b.example/list", 2, 0, 0, 0}}));
+  free_list(head);
+  size_t files = 0;
+  for (const auto& entry : std::filesystem::directory_iterator(root_.path(SDS_SERVER_DIR))) {
+    files += entry.is_regular_file();
+  }
+  EXPECT_EQ(files, 1u);
 }
 
 }  // namespace

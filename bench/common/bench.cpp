@@ -41,13 +41,18 @@ std::string json_escape(const std::string& text) {
 bool run_once(const bench_case& c, bench_result* result, int64_t* elapsed_ns) {
   for (int attempt = 1; attempt <= kTriesPerIteration; ++attempt) {
     if (c.prepare && !c.prepare()) return false;
-    auto start = std::chrono::steady_clock::now();
-    bool ok = c.body();
-    auto end = std::chrono::steady_clock::now();
+    int64_t elapsed = 0;
+    bool ok = false;
+    if (c.timed) {
+      ok = c.timed(&elapsed);
+    } else {
+      auto start = std::chrono::steady_clock::now();
+      ok = c.body();
+      auto end = std::chrono::steady_clock::now();
+      elapsed = std::chrono::duration_cast<std::chrono::nanoseconds>(end - start).count();
+    }
     if (ok) {
-      if (elapsed_ns != nullptr) {
-        *elapsed_ns = std::chrono::duration_cast<std::chrono::nanoseconds>(end - start).count();
-      }
+      if (elapsed_ns != nullptr) *elapsed_ns = elapsed;
       return true;
     }
     if (!c.recover || attempt == kTriesPerIteration || !c.recover()) return false;
@@ -94,6 +99,10 @@ std::vector<bench_result> bench_time_cases(const std::string& group,
     }
   }
   return results;
+}
+
+std::string bench_scenario_name(const std::string& name, const bench_service& service) {
+  return service.label.empty() ? name : name + "@" + service.label;
 }
 
 int64_t bench_quantile(const std::vector<int64_t>& samples_ns, double q) {

@@ -9,12 +9,25 @@
 #include <string>
 #include <vector>
 
+// A build of the service to measure. The benchmark measures the service
+// beside it by default; more builds (an older one, say) are measured in the
+// same run, their scenario names ending in "@label".
+struct bench_service {
+  std::string label;  // empty for the default build
+  std::string path;   // the service binary; its pull module sits beside it
+};
+
 struct bench_options {
   bool quick = false;      // fewer iterations: a smoke run in seconds
   bool verbose = false;    // let the client library's log lines through
   std::string only_group;  // run this group alone when not empty
   std::string json_path;   // where the JSON report goes; empty: nowhere
+  std::vector<bench_service> services;  // at least the default build
 };
+
+// `name` with the label of `service` appended ("name@label"), unchanged for
+// the default build.
+std::string bench_scenario_name(const std::string& name, const bench_service& service);
 
 // One scenario's measurements. `floor` names another result measured in the
 // same run: the cost of the same exchange with nothing but the transport.
@@ -53,6 +66,10 @@ struct bench_case {
   std::function<bool()> prepare = {};
   double floor_scale = 1.0;  // as in bench_result
   double target = 0.0;       // as in bench_result
+  // When set, replaces `body` for a case that times only a part of its
+  // iteration itself (connect to handshake, without the process's exit):
+  // false on failure, the time in its argument.
+  std::function<bool(int64_t* elapsed_ns)> timed = {};
 };
 
 // Runs every case `warmup` times untimed, then `iterations` times timed, the

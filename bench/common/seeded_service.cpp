@@ -1,19 +1,25 @@
 #include "seeded_service.h"
 
+#include <sys/mman.h>
+
 #include <cstdio>
 #include <vector>
 
+#include "activated.h"
+#include "sitedeck-service-paths.h"
 #include "support/seeded_deck.h"
-#include "support/service_harness.h"
 #include "support/temp_root.h"
 
 BenchSeededService::BenchSeededService() = default;
 BenchSeededService::~BenchSeededService() {
-  service_.reset();  // stops the activator while the root still exists
+  services_.clear();  // stops the activators while the root still exists
   root_.reset();
+  // Every service process makes the machine-wide object anew; nobody else
+  // removes it once the benchmark is done.
+  (void)shm_unlink(SDS_SHM_NAME);
 }
 
-bool BenchSeededService::start() {
+bool BenchSeededService::start(const std::vector<bench_service>& services) {
   root_ = std::make_unique<TempRoot>();
   std::vector<SeedItem> items(kBenchDeckItems);
   for (int i = 0; i < kBenchDeckItems; ++i) {
@@ -35,14 +41,22 @@ bool BenchSeededService::start() {
     std::fprintf(stderr, "bench: could not seed the database in %s\n", root_->dir().c_str());
     return false;
   }
-  service_ = std::make_unique<ServiceHarness>();
-  if (!service_->start_activated(/*once=*/false)) {
-    std::fprintf(stderr, "bench: the activator did not start:\n%s\n", service_->output().c_str());
-    return false;
+  for (size_t i = 0; i < services.size(); ++i) {
+    auto activated = std::make_unique<BenchActivated>();
+    // The first build listens where the service's own socket lives.
+    std::string socket = i == 0 ? sds_path(SDS_SOCKET_PATH)
+                                : root_->dir() + "/service-" + std::to_string(i) + ".sock";
+    if (!activated->start(services[i].path, socket)) return false;
+    services_.push_back(std::move(activated));
   }
   return true;
 }
 
-int BenchSeededService::connect(SdsConnection* out) {
-  return service_ ? service_->connect(out) : SDS_ERROR_IO_ERROR;
+bool BenchSeededService::start() {
+  return start({{"", std::string(SITEDECK_BIN_DIR) + "/browser-sitedeck-service"}});
+}
+
+int BenchSeededService::connect(size_t index, SdsConnection* out) {
+  if (index >= services_.size()) return SDS_ERROR_IO_ERROR;
+  return sds_client_connect(services_[index]->socket_path(), out, 10000);
 }

@@ -12,3 +12,5 @@ bool bench_group_deck(const bench_options& options, bench_report* report);
 // Data pulls of 50 items beside a one-process floor, with and without
 // server latency; 500 and 5000 items per item; peak memory.
 bool bench_group_pull(const bench_options& options, bench_report* report);
+// Connect to handshake through the activator, and memory after it.
+bool bench_group_startup(const bench_options& options, bench_report* report);

@@ -10,6 +10,7 @@
 #include <cstring>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db-stmt.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
@@ -20,32 +21,6 @@ namespace {
 constexpr const char* kSiteDeck = "site_deck";
 // Largest icon file read into memory; real touch icons are a few KiB.
 constexpr long kMaxIconFileBytes = 16L << 20;
-
-// The leading decimal number of `text` as atoi reads it (blanks, a sign,
-// digits), saturated instead of overflowing; 0 when there are no digits.
-int leading_int(const char* text) {
-  while (*text == ' ' || (*text >= '\t' && *text <= '\r')) ++text;
-  bool negative = *text == '-';
-  if (*text == '+' || *text == '-') ++text;
-  long long value = 0;
-  for (; *text >= '0' && *text <= '9'; ++text) {
-    value = value * 10 + (*text - '0');
-    if (value > INT_MAX) value = INT_MAX + 1LL;
-  }
-  if (negative) value = -value;
-  if (value > INT_MAX) return INT_MAX;
-  if (value < INT_MIN) return INT_MIN;
-  return static_cast<int>(value);
-}
-
-// Reads "WIDTHxHEIGHT"; false (outputs untouched) when there is no x.
-bool parse_icon_size(const char* text, int* width, int* height) {
-  const char* x = std::strchr(text, 'x');
-  if (x == nullptr) return false;
-  *width = leading_int(text);
-  *height = leading_int(x + 1);
-  return true;
-}
 
 // Reads and decodes the icon file at `path` into `out`; returns the code.
 int load_icon_file(const sds_icon* icon, const char* path, sds_icon_columns* out) {
@@ -94,7 +69,7 @@ int load_icon_file(const sds_icon* icon, const char* path, sds_icon_columns* out
   std::memcpy(out->icon_size, icon->icon_size, sizeof icon->icon_size);
   int text_width = 0;
   int text_height = 0;
-  if (!parse_icon_size(out->icon_size, &text_width, &text_height) || text_width != width ||
+  if (!sds_db_parse_icon_size(out->icon_size, &text_width, &text_height) || text_width != width ||
       text_height != height) {
     char decoded[32];
     (void)std::snprintf(decoded, sizeof decoded, "%dx%d", width, height);
@@ -106,43 +81,6 @@ int load_icon_file(const sds_icon* icon, const char* path, sds_icon_columns* out
   return SDS_ERROR_NONE;
 }
 
-}  // namespace
-
-int sds_get_blob_from_db(int id, int* length, int* height, int* width, unsigned char** bytes) {
-  if (bytes == nullptr) {
-    SDS_LOGE("NULL check::value");
-    return SDS_ERROR_INVALID_PARAMETER;
-  }
-  if (length == nullptr) {
-    SDS_LOGE("NULL check::blob_length");
-    return SDS_ERROR_INVALID_PARAMETER;
-  }
-  if (width == nullptr) {
-    SDS_LOGE("NULL check::blob_width");
-    return SDS_ERROR_INVALID_PARAMETER;
-  }
-  if (height == nullptr) {
-    SDS_LOGE("NULL check::blob_height");
-    return SDS_ERROR_INVALID_PARAMETER;
-  }
-  int code = SDS_ERROR_NONE;
-  (void)sds_db_get_property_blob(sds_db_handle, id, kSiteDeck, "icon_data", bytes, length, &code);
-  if (code != SDS_ERROR_NONE) {
-    SDS_LOGE("Error : %s", sds_error_string(code));
-    return code;
-  }
-  char* size_text = nullptr;
-  (void)sds_db_get_property_string(sds_db_handle, id, kSiteDeck, "icon_size", &size_text, &code);
-  UniqueCStr size_owner(size_text);
-  if (code != SDS_ERROR_NONE) {
-    SDS_LOGE("Error : %s", sds_error_string(code));
-    return code;
-  }
-  (void)parse_icon_size(size_text, width, height);
-  return SDS_ERROR_NONE;
-}
-
-namespace {
 
 // Checks the item and loads its one icon from the icon file; the path of
 // that file goes to `*path` (null when there is none) for the caller to remove.

@@ -44,6 +44,15 @@ int sds_ensure_db_open(void) {
   return sds_db_handle != nullptr ? SDS_ERROR_NONE : SDS_ERROR_DB_OPEN_FAILED;
 }
 
+int sds_ensure_db_sound(void) {
+  if (sds_ensure_db_open() != SDS_ERROR_NONE) return SDS_ERROR_DB_OPEN_FAILED;
+  if (sds_db_is_sound(sds_db_handle)) return SDS_ERROR_NONE;
+  SDS_LOGE("database is damaged: it is made afresh");
+  sds_db_discard(sds_db_handle);
+  sds_db_handle = nullptr;
+  return sds_ensure_db_open();
+}
+
 int sds_get_string_from_db(int id, char** value, const char* column) {
   if (value == nullptr) {
     SDS_LOGE("NULL check::value");

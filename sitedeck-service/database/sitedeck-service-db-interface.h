@@ -13,12 +13,23 @@ extern sqlite3* sds_db_handle;
 // Opens sds_db_handle when it is not open yet: SDS_ERROR_NONE or
 // SDS_ERROR_DB_OPEN_FAILED.
 int sds_ensure_db_open(void);
+// As sds_ensure_db_open, but a database found damaged is first deleted and
+// made afresh (empty, so the stored ETag goes too and the next download is
+// a full one). Meant for the start of a data pull, which is about to refill it.
+int sds_ensure_db_sound(void);
 
 int sds_get_string_from_db(int id, char** value, const char* column);
 int sds_get_int_from_db(int id, sds_db_value* value, const char* column);
 int sds_get_all_ids_from_db(int** ids, int* count, const char* cond_column, const void* cond_value,
                             int cond_type);
 int sds_get_blob_from_db(int id, int* length, int* height, int* width, unsigned char** bytes);
+// As sds_get_blob_from_db, with the same checks, codes and log lines, but
+// the pixels are copied once, straight to where `place` says: it is called
+// with their byte count once they are known to be there, and returns the
+// destination (null: not copied). An I/O failure while copying gives the
+// connection's code for it, or SDS_ERROR_NO_DATA.
+int sds_copy_blob_from_db(int id, int* length, int* height, int* width,
+                          unsigned char* (*place)(int length, void* user), void* user);
 int sds_get_string_for_url_from_db(const char* url, char** value, const char* column);
 
 int update_sitedeck_order_index_to_db(int id, const int* order_index);

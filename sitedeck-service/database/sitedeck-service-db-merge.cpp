@@ -3,7 +3,8 @@
 // removed state, new icons stored, and live sites the list no longer names
 // deleted. The whole merge is one transaction, so neither a reader in another
 // process nor a crash ever sees a half-merged table; within it, one item's
-// failing step does not stop the others.
+// failing step does not stop the others, but a row that could not be written
+// makes the whole merge roll back.
 #include <sqlite3.h>
 #include <unistd.h>
 
@@ -35,15 +36,22 @@ bool run(const char* sql) {
 // another (the icon's four, the order number, the title, the colour and the
 // specially removed state) go into one UPDATE per item: inside the merge's
 // transaction the row ends the same, with a third of the statements.
-void merge_item(sds_item* item, int order) {
+// False when a write of the row itself failed (a read-only or full disk, an
+// I/O error): the table would then not hold the list. A failed icon store
+// is not counted: a broken icon leaves its site without an icon.
+bool merge_item(sds_item* item, int order) {
   if (item->site_name == nullptr || item->site_name[0] == '\0') {
     std::free(item->site_name);
     item->site_name = strdup(item->site_url);
   }
   int code = SDS_ERROR_NONE;
+  bool written = true;
   int id = sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
   const bool stored = id >= 0;
-  if (!stored) id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
+  if (!stored) {
+    id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
+    written = id > 0;
+  }
 
   sds_icon_columns icon;
   sds_db_column_value values[SDS_ICON_COLUMNS_MAX + 4];
@@ -65,8 +73,10 @@ void merge_item(sds_item* item, int order) {
   int write_code = SDS_ERROR_NONE;
   if (sds_db_columns_replace(sds_db_handle, id, "site_deck", values, count, &write_code) != 0) {
     SDS_LOGE("Error : %s", sds_error_string(write_code));
+    written = false;
   }
   if (code != SDS_ERROR_NONE) SDS_LOGE("Error :: %s", sds_error_string(code));
+  return written;
 }
 
 // Removes the downloaded icon files of the list once the merge is over,
@@ -98,8 +108,8 @@ bool collect_urls(const sds_item* head, UrlSet* urls) {
 }
 
 // Pass 2: deletes the live rows whose URL the list does not name. Returns
-// SDS_ERROR_NONE, or the code of the failed id list (SDS_ERROR_NO_DATA when
-// no row is live).
+// SDS_ERROR_NONE, the code of the failed id list (SDS_ERROR_NO_DATA when no
+// row is live), or SDS_ERROR_IO_ERROR when a delete failed.
 int delete_vanished(const sds_item* head) {
   UrlSet listed;
   if (!collect_urls(head, &listed)) {
@@ -125,9 +135,12 @@ int delete_vanished(const sds_item* head) {
     }
     UniqueCStr url(raw_url);
     if (!url || url.get()[0] == '\0' || listed.contains(url.get())) continue;
-    if (delete_sitedeck_item_from_db(url.get()) != 0) SDS_LOGE("Not able to delete one URL");
+    if (delete_sitedeck_item_from_db(url.get()) != 0) {
+      SDS_LOGE("Not able to delete one URL");
+      code = SDS_ERROR_IO_ERROR;
+    }
   }
-  return SDS_ERROR_NONE;
+  return code;
 }
 
 }  // namespace
@@ -144,9 +157,10 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   SdsDbStatementScope statements(sds_db_handle);
 
   int order = 1;
+  bool rows_written = true;
   for (sds_item* item = head; item != nullptr; item = item->next) {
     if (item->site_url == nullptr || item->site_url[0] == '\0') continue;
-    merge_item(item, order);
+    rows_written = merge_item(item, order) && rows_written;
     ++order;
   }
   int code = delete_vanished(head);
@@ -159,8 +173,11 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   }
   // With no live row there is nothing to clean up and the merge is whole,
   // though it answers -1. Any other failed clean-up would leave vanished
-  // sites live beside the new numbering: keep the previous table instead.
-  bool keep = code == SDS_ERROR_NONE || code == SDS_ERROR_NO_DATA;
+  // sites live beside the new numbering, and a row that could not be written
+  // would leave the list incomplete: keep the previous table instead, so
+  // that its ETag stays and the next pull asks for the whole list again.
+  if (!rows_written) SDS_LOGE("a row of the list could not be written");
+  bool keep = rows_written && (code == SDS_ERROR_NONE || code == SDS_ERROR_NO_DATA);
   if (keep && run("COMMIT")) return code == SDS_ERROR_NONE ? 0 : -1;
   (void)run("ROLLBACK");
   return SDS_MERGE_NOT_COMMITTED;

@@ -1,8 +1,9 @@
 // The item database file and its one connection: opening an existing file,
-// replacing a file that is not a database, creating a missing one with the
-// `site_deck` table, closing, finalizing statements and mapping SQLite
-// results to SDS codes. It never creates directories; the database directory
-// comes with the installation. The table layout is described in docs/storage.md.
+// replacing a file that is not a database, creating a missing or empty one
+// with the `site_deck` table, dropping the stored ETag while the table holds
+// no item, closing, finalizing statements and mapping SQLite results to SDS
+// codes. It never creates directories; the database directory comes with the
+// installation. The table layout is described in docs/storage.md.
 #include "database/sitedeck-service-db.h"
 
 #include <sqlite3.h>
@@ -35,6 +36,18 @@ constexpr const char* kCreateUrlIndex =
 // file for a moment; wait for it rather than fail at once.
 constexpr int kBusyTimeoutMs = 2000;
 
+// Reads go through a memory mapping of the file, up to this size, instead of
+// a read() per page: an icon spans some forty overflow pages, and each
+// statement re-reads the file header. A connection setting: the file on disk
+// is the same either way.
+constexpr const char* kMapFileForReads = "PRAGMA mmap_size=268435456";
+
+// The settings every connection of the service gets.
+void configure_connection(sqlite3* db) {
+  (void)sqlite3_busy_timeout(db, kBusyTimeoutMs);
+  (void)sqlite3_exec(db, kMapFileForReads, nullptr, nullptr, nullptr);
+}
+
 // SQLite opens files lazily: a file that is not a database is only noticed
 // at the first statement. Reading the schema version makes that happen now.
 // Returns SQLITE_OK or the result of the failing call.
@@ -45,6 +58,32 @@ int probe_database(sqlite3* db) {
   if (rc != SQLITE_OK) return rc;
   rc = sqlite3_step(stmt.get());
   return rc == SQLITE_ROW || rc == SQLITE_DONE ? SQLITE_OK : rc;
+}
+
+// True when the file holds no schema at all: an empty file, as a creation
+// that could not write its table (a full disk, a crash) leaves it.
+bool has_no_schema(sqlite3* db) {
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(db, "SELECT count(*) FROM sqlite_master", -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  return rc == SQLITE_OK && sqlite3_step(stmt.get()) == SQLITE_ROW &&
+         sqlite3_column_int(stmt.get(), 0) == 0;
+}
+
+// The stored ETag names the list in the table. A table without rows (just
+// created, rebuilt after corruption) holds no list, and a request sent with
+// that ETag would be answered 304 and leave the deck empty until the list
+// changes; without it the next pull fetches the whole list.
+void forget_etag_of_empty_table(sqlite3* db) {
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(db, "SELECT count(*) FROM site_deck", -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  if (rc != SQLITE_OK || sqlite3_step(stmt.get()) != SQLITE_ROW ||
+      sqlite3_column_int(stmt.get(), 0) != 0) {
+    return;
+  }
+  std::string etag = sds_path(SDS_ETAG_PATH);
+  if (unlink(etag.c_str()) == 0) SDS_LOGE("no items stored: the stored ETag is dropped");
 }
 
 // Adds the URL index to a file made before it existed. A file without the
@@ -70,7 +109,29 @@ int sds_db_open(sqlite3** handle) {
   int error_code = SDS_ERROR_NONE;
   int result = __db_open(path.c_str(), handle, &error_code);
   if (error_code != SDS_ERROR_NONE || *handle == nullptr) SDS_LOGE("errorcode : %d", error_code);
+  if (*handle != nullptr) forget_etag_of_empty_table(*handle);
   return result;
+}
+
+bool sds_db_is_sound(sqlite3* handle) {
+  if (handle == nullptr) return true;
+  sqlite3_stmt* raw = nullptr;
+  int rc = sqlite3_prepare_v2(handle, "PRAGMA quick_check(1)", -1, &raw, nullptr);
+  SqliteStmt stmt(raw);
+  if (rc == SQLITE_OK) rc = sqlite3_step(stmt.get());
+  if (rc == SQLITE_ROW) {
+    const auto* verdict = reinterpret_cast<const char*>(sqlite3_column_text(stmt.get(), 0));
+    if (verdict != nullptr && std::string(verdict) == "ok") return true;
+    SDS_LOGE("database check: %s", verdict != nullptr ? verdict : "(none)");
+    return false;
+  }
+  const int primary = rc & 0xff;
+  return primary != SQLITE_CORRUPT && primary != SQLITE_NOTADB;
+}
+
+void sds_db_discard(sqlite3* handle) {
+  if (handle != nullptr) (void)sqlite3_close_v2(handle);
+  delete_database_file(sds_path(SDS_DB_PATH).c_str());
 }
 
 int __db_open(const char* path, sqlite3** handle, int* error_code) {
@@ -78,11 +139,14 @@ int __db_open(const char* path, sqlite3** handle, int* error_code) {
   sqlite3* db = nullptr;
   int rc = sqlite3_open_v2(path, &db, SQLITE_OPEN_READWRITE, nullptr);
   if (rc == SQLITE_OK) {
-    (void)sqlite3_busy_timeout(db, kBusyTimeoutMs);
+    configure_connection(db);
     rc = probe_database(db);
     // Anything but a file that is no database (a busy lock, say) leaves the
     // file as it is: it is a database and is used unchanged.
     if (rc != SQLITE_NOTADB && rc != SQLITE_CORRUPT) {
+      // A file with tables of its own is used as it is; an empty one would
+      // otherwise stay without the table for good.
+      if (rc == SQLITE_OK && has_no_schema(db)) (void)__rebuild_site_deck_tables(db);
       if (rc == SQLITE_OK) ensure_url_index(db);
       *handle = db;
       return 0;
@@ -120,7 +184,7 @@ int __db_open(const char* path, sqlite3** handle, int* error_code) {
     *handle = nullptr;
     return -1;
   }
-  (void)sqlite3_busy_timeout(db, kBusyTimeoutMs);
+  configure_connection(db);
   // A table that can't be created shows later as failing statements.
   (void)__rebuild_site_deck_tables(db);
   *handle = db;
@@ -174,6 +238,7 @@ int __check_table(sqlite3* handle, const char* table) {
 
 void sds_db_close(sqlite3* handle) {
   if (handle == nullptr) return;
+  sds_db_drop_kept_statements(handle);
   if (sqlite3_exec(handle, "VACUUM;", nullptr, nullptr, nullptr) != SQLITE_OK) {
     SDS_LOGE("sqlite3_exec failed");
     return;

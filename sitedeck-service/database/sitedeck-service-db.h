@@ -3,7 +3,8 @@
 // generic row and column operations every accessor is built on. Every
 // operation takes the connection first and reports a reason code through its
 // last argument; statements never outlive the call that prepared them, except
-// inside an SdsDbStatementScope (sitedeck-service-db-stmt-cache.h).
+// inside an SdsDbStatementScope (sitedeck-service-db-stmt-cache.h) and for the
+// few reads every request repeats, which the connection keeps.
 #pragma once
 
 #include <cstdint>
@@ -34,12 +35,23 @@ union sds_db_value {
 };
 
 int sds_db_open(sqlite3** handle);
+// True unless SQLite's quick check finds the file damaged (a page that is no
+// valid page, a broken b-tree); a busy or locked file counts as sound.
+bool sds_db_is_sound(sqlite3* handle);
+// Closes `handle` and deletes the database file with its journal, for a
+// database found damaged; the next sds_db_open creates it afresh.
+void sds_db_discard(sqlite3* handle);
 int __db_open(const char* path, sqlite3** handle, int* error_code);
 int __rebuild_site_deck_tables(sqlite3* handle);
 int __check_table(sqlite3* handle, const char* table);
 void sds_db_close(sqlite3* handle);
 int sds_db_get_errorcode(sqlite3* handle);
 void __db_finalize(sqlite3_stmt* stmt);
+// Finalizes the statements kept for `handle` (the reads of the requests keep
+// theirs for the life of the connection). Whoever closes a connection other
+// than through sds_db_close calls this first: SQLite does not close a
+// connection with statements left.
+void sds_db_drop_kept_statements(sqlite3* handle);
 
 int sds_db_check_duplicated_int(sqlite3* handle, const char* table, const char* column, int value,
                                 int* error_code);

@@ -48,7 +48,11 @@ DbSession::~DbSession() { close_handle(); }
 std::string DbSession::db_path() const { return root_.path(SDS_DB_PATH); }
 
 void DbSession::close_handle() {
-  if (sds_db_handle != nullptr) (void)sqlite3_close(sds_db_handle);
+  if (sds_db_handle != nullptr) {
+    // The reads keep their statements with the connection.
+    sds_db_drop_kept_statements(sds_db_handle);
+    (void)sqlite3_close(sds_db_handle);
+  }
   sds_db_handle = nullptr;
 }
 

@@ -136,20 +136,26 @@ bool ServiceHarness::start_activated(bool once) {
   return ok;
 }
 
-bool ServiceHarness::start_direct() {
+bool ServiceHarness::start_direct() { return start_direct_wrapped({}); }
+
+bool ServiceHarness::start_direct_wrapped(const std::vector<std::string>& wrapper) {
   struct sockaddr_un address {};
   address.sun_family = AF_UNIX;
   if (socket_path_.size() >= sizeof address.sun_path) return false;
   std::memcpy(address.sun_path, socket_path_.c_str(), socket_path_.size() + 1);
   std::error_code ec;
   std::filesystem::create_directories(std::filesystem::path(socket_path_).parent_path(), ec);
+  // A socket file left by an earlier run in this root would make bind fail.
+  (void)unlink(socket_path_.c_str());
   listen_fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (listen_fd_ < 0 ||
       bind(listen_fd_, reinterpret_cast<struct sockaddr*>(&address), sizeof address) != 0 ||
       listen(listen_fd_, 16) != 0) {
     return false;
   }
-  return spawn({service_path_}, listen_fd_, true);
+  std::vector<std::string> argv = wrapper;
+  argv.push_back(service_path_);
+  return spawn(argv, listen_fd_, true);
 }
 
 bool ServiceHarness::start_unactivated() { return spawn({service_path_}, -1, false); }

@@ -28,8 +28,15 @@ class ServiceHarness {
   // Listens on the socket itself and runs the service with it as descriptor 3
   // and LISTEN_FDS/LISTEN_PID set, as the activation would.
   bool start_direct();
+  // As start_direct, with `wrapper` in front of the service: a program and
+  // its arguments that ends by exec'ing the service in the same process
+  // (prlimit, setpriv), so that the activation environment still holds.
+  bool start_direct_wrapped(const std::vector<std::string>& wrapper);
   // Runs the service with no activation at all.
   bool start_unactivated();
+  // Runs `path` instead of the service beside the tests (a copy elsewhere);
+  // call before starting.
+  void set_service_path(const std::string& path) { service_path_ = path; }
 
   // Waits until the directly started service blocks in accept(), so that its
   // signal handling is in place.

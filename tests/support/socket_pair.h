@@ -35,12 +35,12 @@ inline bool readable_now(int fd) {
   return poll(&entry, 1, 0) == 1;
 }
 
-// A peer that already hung up makes this fail instead of raising SIGPIPE,
-// which would end the whole test binary.
+// A peer that has gone away makes this return false: on a socket the write
+// must not raise SIGPIPE, which would end the whole test binary.
 inline bool write_all(int fd, const void* data, size_t length) {
-  ssize_t sent = send(fd, data, length, MSG_NOSIGNAL);
-  if (sent < 0 && errno == ENOTSOCK) sent = write(fd, data, length);
-  return sent == static_cast<ssize_t>(length);
+  ssize_t written = send(fd, data, length, MSG_NOSIGNAL);
+  if (written < 0 && errno == ENOTSOCK) written = write(fd, data, length);
+  return written == static_cast<ssize_t>(length);
 }
 
 inline bool write_int(int fd, int32_t value) { return write_all(fd, &value, sizeof value); }
