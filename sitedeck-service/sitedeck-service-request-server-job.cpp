@@ -8,6 +8,7 @@
 #include <cstdlib>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "database/sitedeck-service-db-stmt-cache.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-request-server.h"
@@ -62,6 +63,8 @@ int sds_check_data_pull_required(sds_server_req_args* args) {
   // A damaged database would keep its damage for good: a 304 answer leaves
   // it as it is and a merge into it fails. Made afresh, this pull refills it.
   (void)sds_ensure_db_sound();
+  // The pull writes most of the file; read it without the memory mapping.
+  SdsDbFileMappingPause unmapped(sds_db_handle);
 
   if (args != nullptr && valid_position(args) && sds_get_city_and_province(args) != 0) {
     std::free(args->province);

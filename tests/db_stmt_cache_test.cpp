@@ -145,4 +145,25 @@ TEST_F(StatementScope, ReadTransactionSpansItsReadsAndLeavesAnOuterOneOpen) {
   EXPECT_EQ(read(1, "title"), "A");
 }
 
+std::string mapping_size() { return DbSession::rows("PRAGMA mmap_size"); }
+
+// A pull read the whole file through the memory mapping (the quick check, a
+// merge of 5000 icons) and kept every page of it in its resident memory.
+TEST_F(StatementScope, PulledFileStayedResidentThroughTheMapping) {
+  const std::string configured = mapping_size();
+  ASSERT_NE(configured, "0");
+  {
+    SdsDbFileMappingPause unmapped(sds_db_handle);
+    EXPECT_EQ(mapping_size(), "0");
+    EXPECT_EQ(read(2, "title"), "B");
+    {
+      SdsDbFileMappingPause again(sds_db_handle);  // nothing mapped: nothing to do
+      EXPECT_EQ(mapping_size(), "0");
+    }
+    EXPECT_EQ(mapping_size(), "0");
+  }
+  EXPECT_EQ(mapping_size(), configured);
+  EXPECT_EQ(read(2, "title"), "B");
+}
+
 }  // namespace

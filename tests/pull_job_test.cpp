@@ -79,6 +79,17 @@ TEST_F(PullJob, NegativeWaitTimeMeansNoPause) {
             2);
 }
 
+// The pull reads and writes the file without the memory mapping, which
+// would keep every page it touched resident; serving maps it again after.
+TEST_F(PullJob, PullLeavesTheFileMappedForServingAsBefore) {
+  const std::string mapped = DbSession::rows("PRAGMA mmap_size");
+  ASSERT_NE(mapped, "0");
+  ASSERT_TRUE(write_server_list({{1, a_.base_url(), 0, 1, false}}));
+  EXPECT_EQ(sds_check_data_pull_required(nullptr), SDS_ERROR_NONE);
+  EXPECT_NE(rows(), "0");
+  EXPECT_EQ(DbSession::rows("PRAGMA mmap_size"), mapped);
+}
+
 TEST_F(PullJob, FirstServerNotModifiedEndsThePullWithoutAskingTheNext) {
   ASSERT_TRUE(a_.control({{"status", "304"}}));
   ASSERT_TRUE(write_server_list({{1, a_.base_url(), 0, 3, false}, {2, b_.base_url(), 0, 1, true}}));

@@ -1,6 +1,7 @@
 // The statements kept by an SdsDbStatementScope: looked up by their SQL
 // text when prepared, reset instead of finalized when given back. And the
-// read transaction of SdsDbReadTransaction.
+// read transaction of SdsDbReadTransaction, and the paused file mapping of
+// SdsDbFileMappingPause.
 #include "database/sitedeck-service-db-stmt-cache.h"
 
 #include <sqlite3.h>
@@ -63,6 +64,28 @@ SdsDbReadTransaction::~SdsDbReadTransaction() {
   if (sqlite3_exec(handle_, "COMMIT", nullptr, nullptr, nullptr) != SQLITE_OK) {
     (void)sqlite3_exec(handle_, "ROLLBACK", nullptr, nullptr, nullptr);
   }
+}
+
+SdsDbFileMappingPause::SdsDbFileMappingPause(sqlite3* handle) {
+  if (handle == nullptr) return;
+  sqlite3_stmt* raw = nullptr;
+  long long size = 0;
+  if (sqlite3_prepare_v2(handle, "PRAGMA mmap_size", -1, &raw, nullptr) == SQLITE_OK &&
+      sqlite3_step(raw) == SQLITE_ROW) {
+    size = sqlite3_column_int64(raw, 0);
+  }
+  (void)sqlite3_finalize(raw);
+  if (size <= 0) return;
+  if (sqlite3_exec(handle, "PRAGMA mmap_size=0", nullptr, nullptr, nullptr) != SQLITE_OK) return;
+  handle_ = handle;
+  size_ = size;
+}
+
+SdsDbFileMappingPause::~SdsDbFileMappingPause() {
+  if (handle_ == nullptr) return;
+  char* restore = sqlite3_mprintf("PRAGMA mmap_size=%lld", size_);
+  if (restore != nullptr) (void)sqlite3_exec(handle_, restore, nullptr, nullptr, nullptr);
+  sqlite3_free(restore);
 }
 
 sqlite3_stmt* sds_db_stmt_cache_take(sqlite3* handle, const char* sql) {

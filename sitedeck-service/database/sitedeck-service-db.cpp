@@ -115,6 +115,8 @@ int sds_db_open(sqlite3** handle) {
 
 bool sds_db_is_sound(sqlite3* handle) {
   if (handle == nullptr) return true;
+  // The check reads every page; through the mapping they would all stay resident.
+  SdsDbFileMappingPause unmapped(handle);
   sqlite3_stmt* raw = nullptr;
   int rc = sqlite3_prepare_v2(handle, "PRAGMA quick_check(1)", -1, &raw, nullptr);
   SqliteStmt stmt(raw);
