@@ -44,9 +44,11 @@ bool sds_db_parse_icon_size(const char* text, int* width, int* height) {
   return true;
 }
 
-int sds_copy_blob_from_db(int id, int* length, int* height, int* width,
-                          unsigned char* (*place)(int length, void* user), void* user) {
-  if (place == nullptr) {
+namespace {
+
+// Checks the outputs of an icon read in the order the messages name them.
+int check_icon_outputs(const void* value, const int* length, const int* width, const int* height) {
+  if (value == nullptr) {
     SDS_LOGE("NULL check::value");
     return SDS_ERROR_INVALID_PARAMETER;
   }
@@ -62,14 +64,13 @@ int sds_copy_blob_from_db(int id, int* length, int* height, int* width,
     SDS_LOGE("NULL check::blob_height");
     return SDS_ERROR_INVALID_PARAMETER;
   }
+  return SDS_ERROR_NONE;
+}
+
+// Reads the item's icon size text into width and height (left alone when the
+// text has no x); the code of the read.
+int read_icon_dimensions(int id, int* width, int* height) {
   int code = SDS_ERROR_NONE;
-  SqliteKeptStmt transaction;
-  (void)sds_db_check_property_blob(sds_db_handle, id, kSiteDeck, "icon_data", &transaction, length,
-                                   &code);
-  if (code != SDS_ERROR_NONE) {
-    SDS_LOGE("Error : %s", sds_error_string(code));
-    return code;
-  }
   char* size_text = nullptr;
   (void)sds_db_get_property_string(sds_db_handle, id, kSiteDeck, "icon_size", &size_text, &code);
   UniqueCStr size_owner(size_text);
@@ -78,6 +79,27 @@ int sds_copy_blob_from_db(int id, int* length, int* height, int* width,
     return code;
   }
   (void)sds_db_parse_icon_size(size_text, width, height);
+  return SDS_ERROR_NONE;
+}
+
+}  // namespace
+
+int sds_copy_blob_from_db(int id, int* length, int* height, int* width,
+                          unsigned char* (*place)(int length, void* user), void* user) {
+  if (int checked = check_icon_outputs(place == nullptr ? nullptr : &place, length, width, height);
+      checked != SDS_ERROR_NONE) {
+    return checked;
+  }
+  int code = SDS_ERROR_NONE;
+  SqliteKeptStmt transaction;
+  (void)sds_db_check_property_blob(sds_db_handle, id, kSiteDeck, "icon_data", &transaction, length,
+                                   &code);
+  if (code != SDS_ERROR_NONE) {
+    SDS_LOGE("Error : %s", sds_error_string(code));
+    return code;
+  }
+  code = read_icon_dimensions(id, width, height);
+  if (code != SDS_ERROR_NONE) return code;
   unsigned char* destination = place(*length, user);
   if (destination != nullptr &&
       sds_db_read_property_blob(sds_db_handle, id, kSiteDeck, "icon_data", destination, *length,
@@ -89,21 +111,9 @@ int sds_copy_blob_from_db(int id, int* length, int* height, int* width,
 }
 
 int sds_get_blob_from_db(int id, int* length, int* height, int* width, unsigned char** bytes) {
-  if (bytes == nullptr) {
-    SDS_LOGE("NULL check::value");
-    return SDS_ERROR_INVALID_PARAMETER;
-  }
-  if (length == nullptr) {
-    SDS_LOGE("NULL check::blob_length");
-    return SDS_ERROR_INVALID_PARAMETER;
-  }
-  if (width == nullptr) {
-    SDS_LOGE("NULL check::blob_width");
-    return SDS_ERROR_INVALID_PARAMETER;
-  }
-  if (height == nullptr) {
-    SDS_LOGE("NULL check::blob_height");
-    return SDS_ERROR_INVALID_PARAMETER;
+  if (int checked = check_icon_outputs(bytes, length, width, height);
+      checked != SDS_ERROR_NONE) {
+    return checked;
   }
   int code = SDS_ERROR_NONE;
   (void)sds_db_get_property_blob(sds_db_handle, id, kSiteDeck, "icon_data", bytes, length, &code);
@@ -111,13 +121,7 @@ int sds_get_blob_from_db(int id, int* length, int* height, int* width, unsigned 
     SDS_LOGE("Error : %s", sds_error_string(code));
     return code;
   }
-  char* size_text = nullptr;
-  (void)sds_db_get_property_string(sds_db_handle, id, kSiteDeck, "icon_size", &size_text, &code);
-  UniqueCStr size_owner(size_text);
-  if (code != SDS_ERROR_NONE) {
-    SDS_LOGE("Error : %s", sds_error_string(code));
-    return code;
-  }
-  (void)sds_db_parse_icon_size(size_text, width, height);
+  code = read_icon_dimensions(id, width, height);
+  if (code != SDS_ERROR_NONE) return code;
   return SDS_ERROR_NONE;
 }
