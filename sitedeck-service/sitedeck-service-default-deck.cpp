@@ -130,6 +130,6 @@ int sds_default_deck_load(void) {
     return SDS_ERROR_DISK_BUSY;
   }
   if (cut_short) SDS_LOGE("default deck cut short: out of memory");
-  SDS_LOGI("default deck loaded: %d items, %d without icon", sites, missing);
+  SDS_LOGI("default deck loaded: %d items (%d icon files missing)", sites, missing);
   return SDS_ERROR_NONE;
 }
