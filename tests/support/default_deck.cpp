@@ -15,8 +15,7 @@ std::string deck_json(const std::vector<DeckSite>& sites) {
     if (!items.empty()) items += ",\n";
     std::string icons;
     if (!s.icon.empty()) {
-      const std::string size =
-          std::to_string(s.image.width) + "x" + std::to_string(s.image.height);
+      const std::string size = std::to_string(s.image.width) + "x" + std::to_string(s.image.height);
       icons = R"({"id": 1, "iconPath": ")" + deck_icon_url("big-" + s.icon) +
               R"(", "iconSize": "512x512", "lastModified": "2026-01-01 00:00:00.000", )"
               R"("isAdministered": false}, {"id": 2, "iconPath": ")" +
