@@ -18,6 +18,7 @@
 #include <cstring>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "sitedeck-service-default-deck.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-request-handler.h"
@@ -160,6 +161,8 @@ void* sds_client_thread_idle(void* arg) {
   }
   (void)pthread_setcanceltype(PTHREAD_CANCEL_DEFERRED, nullptr);
   if (sds_ensure_db_open() == SDS_ERROR_NONE) {
+    // Before the first request is read, so that it already sees the deck.
+    sds_default_deck_load_if_created();
     while (slot->sock >= 0 && slot->client_id >= 0) {
       bool readable = false;
       bool exceptional = false;

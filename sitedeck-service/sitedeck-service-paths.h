@@ -19,6 +19,10 @@
 #define SDS_NEXT_UPDATE_DURATION_PATH SDS_SERVER_DIR "/next_update_duration"
 #define SDS_HERE_XML_PATH SDS_SERVER_DIR "/site_deck_here_xml.xml"
 #define SDS_LOCATION_INFO_PATH SDS_SERVER_DIR "/location_info.xml"
+// The deck installed with the service for a first start: an item list in the
+// content server's format and the icon files it names.
+#define SDS_DEFAULT_DECK_DIR SDS_DATA_DIR "/default-deck"
+#define SDS_DEFAULT_DECK_JSON_PATH SDS_DEFAULT_DECK_DIR "/site_deck_default.json"
 
 // The shared-memory object's name is global to the machine, never prefixed.
 #define SDS_SHM_NAME "/browser_sds_shm_file"

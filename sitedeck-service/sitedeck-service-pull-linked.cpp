@@ -1,6 +1,7 @@
 // The pull's entry points where the pull code is linked in: in the module
 // itself, and in every program but the service binary, whose own
 // sds_pull_get_calls (sitedeck-service-pull-module.cpp) loads the module.
+#include "sitedeck-service-default-deck.h"
 #include "sitedeck-service-pull.h"
 #include "sitedeck-service-request-server.h"
 #include "sitedeck-service-utils.h"
@@ -11,6 +12,7 @@ constexpr sds_pull_calls kLinkedCalls = {
     sds_check_data_pull_required,
     remove_file,
     sds_set_next_update_duration,
+    sds_default_deck_load,
 };
 
 }  // namespace

@@ -13,6 +13,8 @@ struct sds_pull_calls {
   int (*check_data_pull_required)(sds_server_req_args* args);
   int (*remove_file)(const char* path);
   void (*set_next_update_duration)(int seconds);
+  // sds_default_deck_load (sitedeck-service-default-deck.h).
+  int (*load_default_deck)(void);
 };
 
 // Returns the pull's entry points, loading the module on first use in the

@@ -42,6 +42,11 @@ constexpr int kBusyTimeoutMs = 2000;
 // is the same either way.
 constexpr const char* kMapFileForReads = "PRAGMA mmap_size=268435456";
 
+// Set by __db_open when it created the table in a file that had none (a new
+// file, one made afresh after damage, or an empty one), so it holds no row.
+// Cleared by sds_db_open before each open and by sds_db_take_created_table.
+bool g_created_table = false;
+
 // The settings every connection of the service gets.
 void configure_connection(sqlite3* db) {
   (void)sqlite3_busy_timeout(db, kBusyTimeoutMs);
@@ -107,10 +112,17 @@ int sds_db_open(sqlite3** handle) {
   if (handle == nullptr) return -1;
   std::string path = sds_path(SDS_DB_PATH);
   int error_code = SDS_ERROR_NONE;
+  g_created_table = false;
   int result = __db_open(path.c_str(), handle, &error_code);
   if (error_code != SDS_ERROR_NONE || *handle == nullptr) SDS_LOGE("errorcode : %d", error_code);
   if (*handle != nullptr) forget_etag_of_empty_table(*handle);
   return result;
+}
+
+bool sds_db_take_created_table(void) {
+  const bool created = g_created_table;
+  g_created_table = false;
+  return created;
 }
 
 bool sds_db_is_sound(sqlite3* handle) {
@@ -148,7 +160,9 @@ int __db_open(const char* path, sqlite3** handle, int* error_code) {
     if (rc != SQLITE_NOTADB && rc != SQLITE_CORRUPT) {
       // A file with tables of its own is used as it is; an empty one would
       // otherwise stay without the table for good.
-      if (rc == SQLITE_OK && has_no_schema(db)) (void)__rebuild_site_deck_tables(db);
+      if (rc == SQLITE_OK && has_no_schema(db)) {
+        g_created_table = __rebuild_site_deck_tables(db) == 0;
+      }
       if (rc == SQLITE_OK) ensure_url_index(db);
       *handle = db;
       return 0;
@@ -188,7 +202,7 @@ int __db_open(const char* path, sqlite3** handle, int* error_code) {
   }
   configure_connection(db);
   // A table that can't be created shows later as failing statements.
-  (void)__rebuild_site_deck_tables(db);
+  g_created_table = __rebuild_site_deck_tables(db) == 0;
   *handle = db;
   return 0;
 }

@@ -35,6 +35,10 @@ union sds_db_value {
 };
 
 int sds_db_open(sqlite3** handle);
+// True once after an sds_db_open that created the `site_deck` table (the file
+// was missing, damaged or empty), so the table holds no row yet; the flag is
+// cleared by this call and by the next sds_db_open.
+bool sds_db_take_created_table(void);
 // True unless SQLite's quick check finds the file damaged (a page that is no
 // valid page, a broken b-tree); a busy or locked file counts as sound.
 bool sds_db_is_sound(sqlite3* handle);
