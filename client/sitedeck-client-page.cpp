@@ -203,8 +203,8 @@ bool sds_page_url_linkable(const char* url) {
   if (!uri) return false;
   const char* scheme = g_uri_get_scheme(uri.get());
   const char* host = g_uri_get_host(uri.get());
-  return scheme != nullptr && (g_ascii_strcasecmp(scheme, "http") == 0 ||
-                               g_ascii_strcasecmp(scheme, "https") == 0) &&
+  return scheme != nullptr &&
+         (g_ascii_strcasecmp(scheme, "http") == 0 || g_ascii_strcasecmp(scheme, "https") == 0) &&
          host != nullptr && host[0] != '\0';
 }
 

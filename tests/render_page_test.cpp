@@ -86,8 +86,7 @@ TEST(RenderPage, OnlyHttpAndHttpsUrlsBecomeLinks) {
        {"javascript:alert(1)", "JavaScript://a.example/%0Aalert(1)", "data:text/html,hi",
         "vbscript:msgbox", "ftp://a.example/", "file:///etc/passwd", "//a.example/", "/relative",
         "a.example", "https://", "http:///path", "https://a b.example/", " https://a.example/",
-        "https://a.example/\n", "https://a.example/\x7f", "",
-        static_cast<const char*>(nullptr)}) {
+        "https://a.example/\n", "https://a.example/\x7f", "", static_cast<const char*>(nullptr)}) {
     EXPECT_FALSE(sds_page_url_linkable(url)) << (url != nullptr ? url : "(null)");
   }
 }
@@ -119,7 +118,7 @@ TEST(RenderPage, TextsAreEscapedAndMadeValid) {
       {"<b>&\"'", "&lt;b&gt;&amp;&quot;&apos;"},
       {"</script><img src=x onerror=alert(1)>",
        "&lt;/script&gt;&lt;img src=x onerror=alert(1)&gt;"},
-      {"Gr\xc3\xbc\xc3\x9f" "e", "Gr\xc3\xbc\xc3\x9f" "e"},
+      {"Gr\u00fc\u00dfe", "Gr\u00fc\u00dfe"},
       {"cut \xe2\x82", "cut \xef\xbf\xbd\xef\xbf\xbd"},
       {nullptr, ""},
   };
