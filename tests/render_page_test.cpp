@@ -161,21 +161,6 @@ TEST(RenderPage, TilesAreWrittenInOrderWithWhatIsSafeOfEachItem) {
   }
 }
 
-TEST(RenderPage, EmptyDeckStillMakesAPage) {
-  std::string page = render({});
-  EXPECT_NE(page.find("<span class=\"count\">0 sites</span>"), std::string::npos);
-  EXPECT_NE(page.find("<p class=\"empty\">The deck has no live sites.</p>\n<ol class=\"deck\">\n"
-                      "</ol>"),
-            std::string::npos);
-  EXPECT_NE(page.find("</html>\n"), std::string::npos);
-  std::vector<sds_page_tile> one(1);
-  one[0] = {1, "https://a.example/", "A", "#fff", nullptr, 0};
-  EXPECT_NE(render(one).find("<span class=\"count\">1 site</span>"), std::string::npos);
-  char* html = reinterpret_cast<char*>(0x1);
-  EXPECT_EQ(sds_page_render(nullptr, 2, 0, &html), SDS_ERROR_INVALID_PARAMETER);
-  EXPECT_EQ(html, reinterpret_cast<char*>(0x1));
-}
-
 TEST(RenderPageWrite, CreatesTheDirectoryAndReplacesThePageWhole) {
   TempRoot root;
   const std::string dir = root.dir() + "/out/nested";
@@ -195,27 +180,6 @@ TEST(RenderPageWrite, CreatesTheDirectoryAndReplacesThePageWhole) {
     names.push_back(entry.path().filename().string());
   }
   EXPECT_EQ(names, std::vector<std::string>{"index.html"});
-}
-
-TEST(RenderPageWrite, UnusableDirectoryIsReportedWithItsReason) {
-  TempRoot root;
-  const std::string file = root.dir() + "/plain-file";
-  ASSERT_TRUE(write_file(file, "x"));
-  struct Case {
-    std::string dir;
-    std::string reason;
-  } cases[] = {
-      {file, "cannot create " + file + ": Not a directory"},
-      {file + "/below", "cannot create " + file + "/below: Not a directory"},
-  };
-  for (const auto& c : cases) {
-    char* path = reinterpret_cast<char*>(0x1);
-    char* reason = nullptr;
-    EXPECT_EQ(sds_page_write(c.dir.c_str(), "<p></p>", &path, &reason), SDS_ERROR_IO_ERROR);
-    EXPECT_EQ(path, reinterpret_cast<char*>(0x1));
-    EXPECT_EQ(text_of(reason), c.reason);
-  }
-  EXPECT_EQ(read_file(file), "x");
 }
 
 }  // namespace

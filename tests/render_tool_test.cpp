@@ -28,8 +28,8 @@ constexpr int kBrowserTimeoutMs = 120000;
 
 // Stored pixels of an icon as the service keeps them after a download: a
 // real PNG of the given colour type, decoded by the service's own code.
-std::vector<uint8_t> stored_icon(int width, int height, int color_type, int bit_depth) {
-  std::string png = png_encode_image(png_pattern(width, height, color_type, bit_depth));
+std::vector<uint8_t> stored_icon(const PngImage& image) {
+  std::string png = png_encode_image(image);
   unsigned char* raw = nullptr;
   int w = 0, h = 0, size = 0;
   if (convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()), png.size(), &raw,
@@ -48,10 +48,26 @@ SeedItem tile(int id, int order, const char* url, std::optional<std::string> tit
   return item;
 }
 
-void with_icon(SeedItem& item, int width, int height, int color_type, int bit_depth) {
-  item.icon_data = stored_icon(width, height, color_type, bit_depth);
-  item.icon_size = std::to_string(width) + "x" + std::to_string(height);
+void with_icon(SeedItem& item, const PngImage& image) {
+  item.icon_data = stored_icon(image);
+  item.icon_size = std::to_string(image.width) + "x" + std::to_string(image.height);
   item.touch_icon_exists = 1;
+}
+
+void with_icon(SeedItem& item, int width, int height, int color_type, int bit_depth) {
+  with_icon(item, png_pattern(width, height, color_type, bit_depth));
+}
+
+// An opaque icon of one colour, which stays that exact colour when the
+// browser scales it.
+PngImage solid_icon(int size, uint8_t red, uint8_t green, uint8_t blue) {
+  PngImage image;
+  image.width = image.height = size;
+  png_fill(image, [&](int, int, int c) -> uint16_t {
+    const uint8_t samples[4] = {red, green, blue, 0xff};
+    return samples[c];
+  });
+  return image;
 }
 
 // One tile as the browser's DOM shows it.
@@ -136,7 +152,7 @@ TEST_F(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
   // Ids out of step with the order, so that the page's order can only come
   // from order_index.
   SeedItem news = tile(20, 1, "https://news.example/", "News", "#E53935");
-  with_icon(news, 48, 48, 6, 8);
+  with_icon(news, solid_icon(48, 0xff, 0x00, 0x00));
   SeedItem marked = tile(3, 2, "https://marked.example/", "<b>&\"'", "#1E88E5");
   with_icon(marked, 16, 16, 0, 8);
   SeedItem mail = tile(8, 3, "https://mail.example/inbox", "Mail", "#3c3");
@@ -201,6 +217,10 @@ TEST_F(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
     EXPECT_GE(counts[colour], 2000) << std::hex << colour;
   }
   EXPECT_EQ(counts[0xffeb3b], 0);
+  // The red icon shows red at its 56x56 on the page: the stored B,G,R,A
+  // bytes reached the PNG in the right order.
+  EXPECT_GE(counts[0xff0000], 56 * 56 * 3 / 4);
+  EXPECT_EQ(counts[0x0000ff], 0);
 }
 
 TEST_F(RenderTool, EmptyDeckGivesAPageWithNoTiles) {
