@@ -4,6 +4,7 @@
 // item's fields and pixels) and leaves the page itself to
 // sitedeck-client-page.h.
 #include <cstdio>
+#include <cstdlib>
 #include <ctime>
 #include <vector>
 
@@ -13,6 +14,13 @@
 #include "sitedeck-tool.h"
 
 namespace {
+
+// A start page with more tiles than this is no longer a start page, and the
+// cap keeps a deck that a broken service inflates from filling the memory.
+constexpr size_t kMaxTiles = 1000;
+// Icons embedded in one page, in PNG bytes; the icons after that get their
+// letter, so that the page stays one a browser opens quickly.
+constexpr size_t kMaxIconBytes = 64u << 20;
 
 // What one tile needs beyond the item's texts: its icon as PNG.
 struct sds_render_item {
@@ -25,7 +33,7 @@ struct sds_render_item {
 // not there, or that the service or the encoder can't hand over while the
 // connection stays usable, leaves the tile with its letter instead; only a
 // lost connection fails the page.
-int __sds_render_icon(SdsConnection& connection, sds_render_item* entry) {
+int __sds_render_icon(SdsConnection& connection, sds_render_item* entry, size_t* icon_bytes) {
   int32_t id = entry->item.id;
   sds_client_icon icon;
   int status = sds_client_get_icon(connection, id, &icon);
@@ -46,6 +54,15 @@ int __sds_render_icon(SdsConnection& connection, sds_render_item* entry) {
                  id, icon.width, icon.height);
     return SDS_ERROR_NONE;
   }
+  if (*icon_bytes + static_cast<size_t>(png_size) > kMaxIconBytes) {
+    std::free(png);
+    std::fprintf(stderr,
+                 "sitedeck: render: item %d: the page holds %zu bytes of icons already; "
+                 "showing a letter instead\n",
+                 id, *icon_bytes);
+    return SDS_ERROR_NONE;
+  }
+  *icon_bytes += static_cast<size_t>(png_size);
   entry->png.reset(png);
   entry->png_size = png_size;
   return SDS_ERROR_NONE;
@@ -63,6 +80,13 @@ int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
   int status = sds_client_get_ids_by_dirty(connection, 1, &ids);
   if (status != SDS_ERROR_NONE && status != SDS_ERROR_NO_DATA) return status;
   size_t count = status == SDS_ERROR_NONE ? static_cast<size_t>(ids.count) : 0;
+  if (count > kMaxTiles) {
+    std::fprintf(stderr,
+                 "sitedeck: render: the deck has %zu live sites; the page shows the first %zu\n",
+                 count, kMaxTiles);
+    count = kMaxTiles;
+  }
+  size_t icon_bytes = 0;
 
   std::vector<sds_render_item> entries(count);
   std::vector<sds_page_tile> tiles(count);
@@ -70,7 +94,7 @@ int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
     sds_render_item& entry = entries[i];
     status = sds_client_read_item(connection, ids.ids.get()[i], false, &entry.item);
     if (status != SDS_ERROR_NONE) return status;
-    status = __sds_render_icon(connection, &entry);
+    status = __sds_render_icon(connection, &entry, &icon_bytes);
     if (status != SDS_ERROR_NONE) return status;
     tiles[i].id = entry.item.id;
     tiles[i].url = entry.item.url.get();

@@ -235,6 +235,23 @@ TEST_F(RenderTool, EmptyDeckGivesAPageWithNoTiles) {
   EXPECT_EQ(page.find("<li"), std::string::npos);
 }
 
+TEST_F(RenderTool, OversizedDeckIsCutToTheFirstThousandTiles) {
+  std::vector<SeedItem> items;
+  for (int i = 1; i <= 1001; ++i) {
+    items.push_back(seed_item(i, "https://site" + std::to_string(i) + ".example/", "S", i));
+  }
+  ASSERT_TRUE(seed_deck(items));
+  ASSERT_TRUE(service_.start_activated(/*once=*/false));
+  ProcessResult result = sitedeck({"render", root_.dir() + "/big"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.err,
+            "sitedeck: render: the deck has 1001 live sites; the page shows the first 1000\n");
+  std::string page = read_file(root_.dir() + "/big/index.html");
+  EXPECT_NE(page.find("data-id=\"1000\""), std::string::npos);
+  EXPECT_EQ(page.find("data-id=\"1001\""), std::string::npos);
+}
+
 TEST_F(RenderTool, BadUsageAndUnwritableDirectoryAreReported) {
   ASSERT_TRUE(seed_deck({seed_item(1, "https://a.example/", "A", 1)}));
   ASSERT_TRUE(service_.start_activated(/*once=*/false));
