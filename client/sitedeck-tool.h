@@ -28,6 +28,7 @@ int sds_tool_icon(SdsConnection& connection, int argc, char** argv);
 int sds_tool_next_update(SdsConnection& connection, int argc, char** argv);
 int sds_tool_release(SdsConnection& connection, int argc, char** argv);
 int sds_tool_init(SdsConnection& connection, int argc, char** argv);
+int sds_tool_render(SdsConnection& connection, int argc, char** argv);
 
 // Parses a whole decimal item id (0 to INT32_MAX); false for anything else.
 bool sds_tool_parse_id(const char* text, int32_t* id);

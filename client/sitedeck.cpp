@@ -31,6 +31,7 @@ constexpr sds_tool_command kCommands[] = {
     {"release", "", "remove the shared-memory object (ends the connection)", sds_tool_release},
     {"init", "--lat LAT --lon LON [--version V]",
      "run a data pull; exit 0 when the deck is current afterwards", sds_tool_init},
+    {"render", "OUT_DIR", "write the deck as a start page to OUT_DIR/index.html", sds_tool_render},
 };
 
 struct sds_tool_options {
