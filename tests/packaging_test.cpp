@@ -1,0 +1,245 @@
+// The installation as a package would make it: the files `cmake --install`
+// puts below a staging directory, the units and the tmpfiles.d entry filled
+// in for the prefix, the installed service finding its installed pull
+// module, and systemd's own tools (systemd-tmpfiles, systemd-analyze)
+// accepting what was installed.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <string>
+
+#include "sitedeck-client-commands.h"
+#include "sitedeck-client.h"
+#include "sitedeck-service-paths.h"
+#include "support/service_harness.h"
+#include "support/staged_install.h"
+#include "support/temp_root.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+const std::string kBin = SITEDECK_INSTALL_BINDIR;
+const std::string kModuleDir = SITEDECK_INSTALL_MODULEDIR;
+const std::string kShareDir = std::string(SITEDECK_INSTALL_DATADIR) + "/browser-sitedeck-service";
+const std::string kUnitDir = "lib/systemd/system";
+
+// Every file below `dir`, relative to it, with whether it may be executed.
+std::map<std::string, bool> files_below(const std::string& dir) {
+  std::map<std::string, bool> files;
+  for (const auto& entry : fs::recursive_directory_iterator(dir)) {
+    if (entry.is_directory()) continue;
+    bool executable = (entry.status().permissions() & fs::perms::owner_exec) != fs::perms::none;
+    files[fs::relative(entry.path(), dir).string()] = executable;
+  }
+  return files;
+}
+
+mode_t mode_of(const std::string& path) {
+  struct stat info {};
+  return stat(path.c_str(), &info) == 0 ? (info.st_mode & 07777) : 0;
+}
+
+// Installs for `prefix` below `stage`; a failed installation fails the case.
+void install_or_fail(const std::string& stage, const std::string& prefix) {
+  ProcessResult result = install_staged(stage, prefix);
+  ASSERT_TRUE(result.finished);
+  ASSERT_EQ(result.exit_code, 0) << result.out << result.err;
+}
+
+// Skips the case when `tool` is missing, or fails it when the environment
+// requires the systemd tools; returns the tool's path otherwise.
+#define REQUIRE_TOOL(variable, tool)                                              \
+  std::string variable = find_program(tool);                                      \
+  if (variable.empty()) {                                                         \
+    if (systemd_tools_required()) FAIL() << tool " is missing (package systemd)"; \
+    GTEST_SKIP() << tool " is not installed (package systemd); skipped";          \
+  }
+
+TEST(Packaging, InstallPutsEveryFileInPlaceAndNothingElse) {
+  TempRoot root;
+  std::string stage = root.dir() + "/stage";
+  install_or_fail(stage, "/usr");
+
+  // Path below the stage, and whether it must be executable. Test, benchmark,
+  // fuzzing and stand-in programs stay in the build tree.
+  std::map<std::string, bool> expected = {
+      {"usr/" + kBin + "/browser-sitedeck-service", true},
+      {"usr/" + kBin + "/sitedeck", true},
+      {"usr/" + kModuleDir + "/libsitedeck-pull.so", false},
+      {"usr/" + kShareDir + "/site_deck_server_data.xml", false},
+      {"usr/" + kUnitDir + "/browser-sitedeck-service.socket", false},
+      {"usr/" + kUnitDir + "/browser-sitedeck-service.service", false},
+      {"usr/lib/tmpfiles.d/browser-sitedeck-service.conf", false},
+  };
+  // The sample default deck: its item list and every icon it names.
+  for (const char* name : {"site_deck_default.json", "news-96.png", "mail-96.png", "maps-96.png",
+                           "weather-96.png", "video-96.png", "shop-96.png", "wiki-96.png"}) {
+    expected["usr/" + kShareDir + "/default-deck/" + name] = false;
+  }
+  std::map<std::string, bool> installed = files_below(stage);
+  // The module is loaded, never executed: whether it carries the executable
+  // bit is the platform's custom.
+  auto module = installed.find("usr/" + kModuleDir + "/libsitedeck-pull.so");
+  if (module != installed.end()) module->second = false;
+  EXPECT_EQ(installed, expected);
+
+  // The sample server list is the one in the source tree, byte for byte.
+  EXPECT_EQ(read_file(stage + "/usr/" + kShareDir + "/site_deck_server_data.xml"),
+            read_file(std::string(SITEDECK_SOURCE_DIR) + "/packaging/site_deck_server_data.xml"));
+}
+
+// The units and the tmpfiles.d entry name installed files: they must name
+// them for the prefix chosen when installing, not the one of the build.
+TEST(Packaging, UnitsAndTmpfilesNameTheInstalledFilesForEachPrefix) {
+  struct Case {
+    const char* prefix;
+    std::string service;
+    std::string server_list;
+  };
+  const Case cases[] = {
+      {"/usr", "/usr/" + kBin + "/browser-sitedeck-service",
+       "/usr/" + kShareDir + "/site_deck_server_data.xml"},
+      {"/opt/sitedeck", "/opt/sitedeck/" + kBin + "/browser-sitedeck-service",
+       "/opt/sitedeck/" + kShareDir + "/site_deck_server_data.xml"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.prefix);
+    TempRoot root;
+    std::string stage = root.dir() + "/stage";
+    install_or_fail(stage, c.prefix);
+    std::string base = stage + c.prefix;
+    std::string service = read_file(base + "/" + kUnitDir + "/browser-sitedeck-service.service");
+    EXPECT_EQ(unit_setting(service, "ExecStart"), c.service);
+    EXPECT_TRUE(file_exists(stage + c.service));
+    EXPECT_EQ(service.find("@SITEDECK_"), std::string::npos) << "a placeholder was left unfilled";
+    EXPECT_EQ(unit_setting(service, "ReadWritePaths"), SDS_DATA_DIR);
+
+    std::string socket = read_file(base + "/" + kUnitDir + "/browser-sitedeck-service.socket");
+    EXPECT_EQ(unit_setting(socket, "ListenStream"), SDS_SOCKET_PATH);
+    EXPECT_EQ(unit_setting(socket, "Accept"), "no");
+
+    std::string tmpfiles = read_file(base + "/lib/tmpfiles.d/browser-sitedeck-service.conf");
+    std::string copy_line = std::string("C ") + SDS_SERVER_DATA_XML + " - - - - " + c.server_list;
+    EXPECT_NE(tmpfiles.find(copy_line + "\n"), std::string::npos) << tmpfiles;
+    EXPECT_EQ(tmpfiles.find("@SITEDECK_"), std::string::npos) << "a placeholder was left unfilled";
+  }
+}
+
+// The installed binary lives apart from its module (bin/ and lib/): it must
+// still load the module, and the one of its own installation.
+TEST(Packaging, InstalledServiceLoadsItsInstalledPullModule) {
+  TempRoot root;
+  std::string stage = root.dir() + "/stage";
+  install_or_fail(stage, "/usr");
+  ServiceHarness service;
+  service.set_service_path(stage + "/usr/" + kBin + "/browser-sitedeck-service");
+  ASSERT_TRUE(service.start_direct());
+  SdsConnection connection;
+  ASSERT_EQ(service.connect(&connection), SDS_ERROR_NONE) << service.output();
+
+  // No server list in the root: the pull runs and fails, which it can only
+  // do once the module is loaded.
+  EXPECT_EQ(sds_client_initialize(connection, 37.5, 127.25, "1.0"), SDS_ERROR_DATA_PULL_FAILED);
+  std::ifstream maps("/proc/" + std::to_string(service.pid()) + "/maps");
+  std::string line, mapped_module;
+  while (std::getline(maps, line)) {
+    size_t at = line.find("/libsitedeck-pull.so");
+    if (at != std::string::npos) mapped_module = line.substr(line.find('/'));
+  }
+  std::string installed_module = stage + "/usr/" + kModuleDir + "/libsitedeck-pull.so";
+  EXPECT_EQ(fs::path(mapped_module), fs::canonical(installed_module));
+  EXPECT_FALSE(service.has_message_matching(R"(\[CRITICAL\] cannot load .*)")) << service.output();
+  connection.close();
+  int status = 0;
+  ASSERT_TRUE(service.wait_exit(&status));
+  EXPECT_EQ(exit_code_of(status), 0) << service.output();
+}
+
+TEST(Packaging, TmpfilesCreatesTheDataDirectoriesAndCopiesTheServerListOnce) {
+  REQUIRE_TOOL(tmpfiles, "systemd-tmpfiles");
+  TempRoot root;
+  std::string stage = root.dir() + "/stage";
+  install_or_fail(stage, "/usr");
+  // The entry is read from the stage; its paths, the copy's source included,
+  // are taken below --root.
+  const std::vector<std::string> create = {
+      tmpfiles, "--create", "--root=" + stage,
+      stage + "/usr/lib/tmpfiles.d/browser-sitedeck-service.conf"};
+  ProcessResult result = run_process(create);
+  ASSERT_TRUE(result.finished);
+  ASSERT_EQ(result.exit_code, 0) << result.err;
+
+  const struct {
+    const char* path;
+    mode_t mode;
+  } dirs[] = {
+      {SDS_DATA_DIR, 0755},
+      {SDS_SERVER_DIR, 0750},
+      {SDS_DATABASE_DIR, 0700},
+      {SDS_IMAGES_DIR, 0700},
+  };
+  for (const auto& d : dirs) {
+    SCOPED_TRACE(d.path);
+    EXPECT_TRUE(fs::is_directory(stage + d.path));
+    EXPECT_EQ(mode_of(stage + d.path), d.mode);
+  }
+  std::string server_list = stage + SDS_SERVER_DATA_XML;
+  std::string sample = read_file(stage + "/usr/" + kShareDir + "/site_deck_server_data.xml");
+  EXPECT_EQ(read_file(server_list), sample);
+  // The default deck arrives whole, ready for a first start.
+  EXPECT_EQ(read_file(stage + SDS_DEFAULT_DECK_JSON_PATH),
+            read_file(stage + "/usr/" + kShareDir + "/default-deck/site_deck_default.json"));
+  EXPECT_TRUE(file_exists(stage + SDS_DEFAULT_DECK_DIR + std::string("/wiki-96.png")));
+
+  // The service rewrites the list when a server moves for good: running the
+  // entry again (every boot does) must keep that.
+  const std::string moved = "<values><Server><Id>1</Id></Server></values>\n";
+  ASSERT_TRUE(write_file(server_list, moved));
+  result = run_process(create);
+  ASSERT_TRUE(result.finished);
+  ASSERT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(read_file(server_list), moved);
+}
+
+TEST(Packaging, SystemdAcceptsTheInstalledUnitsAndTheirSandbox) {
+  REQUIRE_TOOL(analyze, "systemd-analyze");
+  std::string system_units;
+  for (const char* dir : {"/usr/lib/systemd/system", "/lib/systemd/system"}) {
+    if (system_units.empty() && file_exists(std::string(dir) + "/sockets.target"))
+      system_units = dir;
+  }
+  if (system_units.empty()) {
+    if (systemd_tools_required()) FAIL() << "systemd's own units are missing";
+    GTEST_SKIP() << "systemd's own units (sockets.target) are not installed; skipped";
+  }
+  TempRoot root;
+  std::string stage = root.dir() + "/stage";
+  install_or_fail(stage, "/usr");
+  // Verifying below --root checks ExecStart in the stage; the units' default
+  // dependencies (sysinit.target, sockets.target) must be found there too,
+  // so systemd's own units are copied beside them.
+  fs::create_directories(stage + "/lib/systemd");
+  fs::copy(system_units, stage + "/lib/systemd/system",
+           fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+
+  ProcessResult verify =
+      run_process({analyze, "verify", "--root=" + stage, "browser-sitedeck-service.socket",
+                   "browser-sitedeck-service.service"});
+  ASSERT_TRUE(verify.finished);
+  EXPECT_EQ(verify.exit_code, 0) << verify.err;
+  // Unknown or misspelt settings are only warned about.
+  EXPECT_EQ(verify.err, "");
+
+  // systemd's own rating of the sandbox, 0 (tight) to 10 (open): the service
+  // needs the network, /dev/shm and root's chown, which alone cost about 2.5.
+  ProcessResult security = run_process({analyze, "security", "--offline=yes", "--threshold=30",
+                                        "--root=" + stage, "browser-sitedeck-service.service"});
+  ASSERT_TRUE(security.finished);
+  EXPECT_EQ(security.exit_code, 0) << security.out << security.err;
+}
+
+}  // namespace
