@@ -170,6 +170,13 @@ void __sds_shm_give_to_app(int fd) {
 
 int sds_alloc_shm(void) {
   UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT, 0660));
+  // With fs.protected_regular set (the default on many distributions), the
+  // kernel refuses an O_CREAT open of an existing file in a sticky directory
+  // such as /dev/shm when another account owns it, root included: exactly
+  // the object of an earlier connection once handed to the browser's account.
+  // Opening the existing object without O_CREAT is allowed, and is what this
+  // call needs anyway.
+  if (!fd && errno == EACCES) fd.reset(shm_open(SDS_SHM_NAME, O_RDWR, 0660));
   if (!fd) {
     __sds_log_alloc_open_error(errno);
     return 0;

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <string>
 
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
@@ -54,6 +55,44 @@ TEST_F(ShmTest, OwnerIsTheAppAccountOnlyWhereItExists) {
   bool app_exists = user != nullptr && group != nullptr;
   EXPECT_EQ(st.st_uid, app_exists ? user->pw_uid : geteuid());
   EXPECT_EQ(st.st_gid, app_exists ? group->gr_gid : getegid());
+}
+
+// Reads or sets a kernel switch under /proc/sys; false when it can't.
+bool read_sysctl(const char* path, std::string* value) {
+  UniqueFd fd(open(path, O_RDONLY));
+  char text[16] = {};
+  if (!fd || read(fd.get(), text, sizeof text - 1) <= 0) return false;
+  *value = text;
+  return true;
+}
+bool write_sysctl(const char* path, const std::string& value) {
+  UniqueFd fd(open(path, O_WRONLY));
+  return fd && write(fd.get(), value.data(), value.size()) == static_cast<ssize_t>(value.size());
+}
+
+// A connection after the first finds the object handed to the browser's
+// account. Under fs.protected_regular the kernel refuses even root an O_CREAT
+// open of it, and every later connection failed its handshake with status 2.
+TEST_F(ShmTest, ObjectOwnedByAnotherAccountIsReopenedUnderProtectedRegular) {
+  constexpr const char* kSwitch = "/proc/sys/fs/protected_regular";
+  const struct passwd* other = getpwnam("nobody");
+  std::string before;
+  if (geteuid() != 0 || other == nullptr || !read_sysctl(kSwitch, &before)) {
+    GTEST_SKIP() << "needs root, the account nobody and " << kSwitch;
+  }
+  if (!write_sysctl(kSwitch, "1")) GTEST_SKIP() << kSwitch << " can't be set here";
+  {
+    UniqueFd made(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT, 0666));
+    ASSERT_TRUE(made);
+    ASSERT_EQ(fchown(made.get(), other->pw_uid, other->pw_gid), 0);
+  }
+  const int result = sds_alloc_shm();
+  const bool restored = write_sysctl(kSwitch, before);
+  EXPECT_EQ(result, 1);
+  EXPECT_TRUE(restored) << "could not restore " << kSwitch << " to " << before;
+  struct stat st {};
+  ASSERT_EQ(stat(SDS_SHM_FILE_PATH, &st), 0);
+  EXPECT_EQ(static_cast<size_t>(st.st_size), SDS_SHM_SIZE);
 }
 
 TEST_F(ShmTest, MappingsShareTheContent) {
