@@ -266,8 +266,9 @@ int main(int argc, char** argv) {
   }
   int status = command->run(connection, static_cast<int>(arguments.size()) - 1, arguments.data());
   if (status == kSdsToolUsage) {
-    std::fprintf(stderr, "usage: sitedeck %s %s\nTry 'sitedeck %s --help' for more information.\n",
-                 command->name, command->arguments, command->name);
+    std::fprintf(stderr, "usage: sitedeck %s%s%s\nTry 'sitedeck %s --help' for more information.\n",
+                 command->name, command->arguments[0] != '\0' ? " " : "", command->arguments,
+                 command->name);
     return 2;
   }
   if (status == kSdsToolReported) return 1;
