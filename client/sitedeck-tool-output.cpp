@@ -218,8 +218,8 @@ std::string sds_tool_format_table(const sds_tool_table& table, const sds_tool_se
 }
 
 std::string sds_tool_format_fields(const std::vector<std::pair<std::string, sds_tool_cell>>& fields,
-                                   const sds_tool_settings& settings) {
-  size_t key_width = 0;
+                                   const sds_tool_settings& settings, size_t min_key_columns) {
+  size_t key_width = min_key_columns;
   for (const auto& field : fields) {
     key_width = std::max(key_width, sds_tool_display_width(field.first) + 1);
   }

@@ -59,8 +59,10 @@ struct sds_tool_table {
 std::string sds_tool_format_table(const sds_tool_table& table, const sds_tool_settings& settings);
 
 // Aligned "key: value" lines; a value may carry a swatch as a cell does.
+// Values start after the widest key or at `min_key_columns`, whichever is
+// further, so that blocks printed apart still line up.
 std::string sds_tool_format_fields(const std::vector<std::pair<std::string, sds_tool_cell>>& fields,
-                                   const sds_tool_settings& settings);
+                                   const sds_tool_settings& settings, size_t min_key_columns = 0);
 
 // SGR `code` around `text` when colours are on ("1" bold, "2" dim...).
 std::string sds_tool_style(const std::string& text, const char* code,

@@ -154,14 +154,32 @@ std::string __time_stamp(time_t when) {
   return text;
 }
 
+std::string __server_table(const sds_status_report& report, const sds_tool_settings& settings) {
+  sds_tool_table table;
+  table.header = {"  ID", "BASE URL", "WAIT", "RETRIES", "FALLBACK"};
+  table.shrinkable = {false, true, false, false, false};
+  for (const auto& server : report.servers) {
+    table.rows.push_back({{"  " + std::to_string(server.id)},
+                          {server.base_url},
+                          {std::to_string(server.wait_time) + " s"},
+                          {std::to_string(server.retry_count)},
+                          {server.fall_back ? "yes" : "no"}});
+  }
+  return sds_tool_format_table(table, settings);
+}
+
 void __print_text(const sds_status_report& report, const sds_tool_settings& settings) {
-  std::vector<std::pair<std::string, sds_tool_cell>> fields;
-  fields.push_back({"data directory", {report.data_dir}});
+  // Keys of both blocks line up: "data directory" is the widest.
+  constexpr size_t kKeyColumns = sizeof "data directory:" - 1;
   std::string servers =
       report.have_server_list
           ? std::to_string(report.servers.size()) + " configured"
           : "none (no usable server list at " + sds_path(SDS_SERVER_DATA_XML) + ")";
-  fields.push_back({"servers", {servers}});
+  std::string out = sds_tool_format_fields(
+      {{"data directory", {report.data_dir}}, {"servers", {servers}}}, settings, kKeyColumns);
+  if (!report.servers.empty()) out += __server_table(report, settings);
+
+  std::vector<std::pair<std::string, sds_tool_cell>> fields;
   fields.push_back({"stored ETag", {report.have_etag ? report.etag : "none"}});
   std::string duration = "none (86400 s is used)";
   if (report.duration_valid) {
@@ -188,20 +206,7 @@ void __print_text(const sds_status_report& report, const sds_tool_settings& sett
     std::string why = report.database_problem.empty() ? "" : ": " + report.database_problem;
     fields.push_back({"database", {"no database at " + report.database_path + why}});
   }
-  std::string out = sds_tool_format_fields(fields, settings);
-  if (!report.servers.empty()) {
-    sds_tool_table table;
-    table.header = {"  ID", "BASE URL", "WAIT", "RETRIES", "FALLBACK"};
-    table.shrinkable = {false, true, false, false, false};
-    for (const auto& server : report.servers) {
-      table.rows.push_back({{"  " + std::to_string(server.id)},
-                            {server.base_url},
-                            {std::to_string(server.wait_time) + " s"},
-                            {std::to_string(server.retry_count)},
-                            {server.fall_back ? "yes" : "no"}});
-    }
-    out += sds_tool_format_table(table, settings);
-  }
+  out += sds_tool_format_fields(fields, settings, kKeyColumns);
   std::fwrite(out.data(), 1, out.size(), stdout);
 }
 

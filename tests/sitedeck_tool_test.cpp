@@ -2,7 +2,9 @@
 // with a seeded database: the table of `list`, the fields of `show`, the PNG
 // that `icon -o` writes, and how failures and bad usage are reported.
 #include <gtest/gtest.h>
+#include <json-glib/json-glib.h>
 
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -140,6 +142,112 @@ TEST_F(SitedeckTool, NextUpdatePrintsTheSeconds) {
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 0) << result.err;
   EXPECT_EQ(result.out, "7200\n");
+}
+
+struct JsonParserFree {
+  void operator()(JsonParser* parser) const { g_object_unref(parser); }
+};
+using UniqueJsonParser = std::unique_ptr<JsonParser, JsonParserFree>;
+
+// Parses the tool's output with json-glib; `*root` is its root object.
+UniqueJsonParser ParseJson(const std::string& text, JsonObject** root) {
+  UniqueJsonParser parser(json_parser_new());
+  EXPECT_TRUE(json_parser_load_from_data(parser.get(), text.c_str(), -1, nullptr)) << text;
+  JsonNode* node = json_parser_get_root(parser.get());
+  *root = node != nullptr && JSON_NODE_HOLDS_OBJECT(node) ? json_node_get_object(node) : nullptr;
+  return parser;
+}
+
+TEST_F(SitedeckTool, JsonListHasEveryLiveItemWithNullsForWhatIsNotStored) {
+  ProcessResult result = sitedeck({"--json", "list"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  JsonObject* root = nullptr;
+  UniqueJsonParser parser = ParseJson(result.out, &root);
+  ASSERT_NE(root, nullptr);
+  JsonArray* items = json_object_get_array_member(root, "items");
+  ASSERT_EQ(json_array_get_length(items), 3u);
+  JsonObject* news = json_array_get_object_element(items, 0);
+  EXPECT_EQ(json_object_get_int_member(news, "id"), 7);
+  EXPECT_STREQ(json_object_get_string_member(news, "title"), "News");
+  EXPECT_STREQ(json_object_get_string_member(news, "url"), "https://news.example/");
+  EXPECT_STREQ(json_object_get_string_member(news, "dominant_color"), "#AA0000");
+  EXPECT_STREQ(json_object_get_string_member(news, "icon_size"), "4x3");
+  EXPECT_EQ(json_object_get_int_member(news, "touch_icon_exists"), 1);
+  EXPECT_EQ(json_object_get_int_member(news, "favicon_exists"), 1);
+  JsonObject* mail = json_array_get_object_element(items, 1);
+  EXPECT_EQ(json_object_get_int_member(mail, "id"), 3);
+  EXPECT_TRUE(json_object_get_null_member(mail, "dominant_color"));
+  EXPECT_TRUE(json_object_get_null_member(mail, "icon_size"));
+  EXPECT_EQ(json_object_get_int_member(json_array_get_object_element(items, 2), "id"), 5);
+}
+
+TEST_F(SitedeckTool, JsonShowHasTheFieldsAndTheIconSize) {
+  // The option may follow the command as well.
+  ProcessResult result = sitedeck({"show", "7", "--json"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  JsonObject* root = nullptr;
+  UniqueJsonParser parser = ParseJson(result.out, &root);
+  ASSERT_NE(root, nullptr);
+  EXPECT_EQ(json_object_get_int_member(root, "id"), 7);
+  EXPECT_STREQ(json_object_get_string_member(root, "url"), "https://news.example/");
+  JsonObject* icon = json_object_get_object_member(root, "icon");
+  ASSERT_NE(icon, nullptr);
+  EXPECT_EQ(json_object_get_int_member(icon, "width"), 4);
+  EXPECT_EQ(json_object_get_int_member(icon, "height"), 3);
+  EXPECT_EQ(json_object_get_int_member(icon, "bytes"), 48);
+
+  result = sitedeck({"--json", "show", "3"});
+  UniqueJsonParser parser3 = ParseJson(result.out, &root);
+  ASSERT_NE(root, nullptr);
+  EXPECT_TRUE(json_object_get_null_member(root, "icon"));
+  EXPECT_TRUE(json_object_get_null_member(root, "dominant_color"));
+
+  // A failure is told on stderr and by the exit status, never as JSON.
+  result = sitedeck({"--json", "show", "99"});
+  EXPECT_EQ(result.exit_code, 1);
+  EXPECT_EQ(result.out, "");
+  EXPECT_EQ(result.err,
+            "sitedeck: the service answered 8 SDS_ERROR_ID_NOT_FOUND: no item has this id\n");
+}
+
+TEST_F(SitedeckTool, JsonOfTheSimpleCommands) {
+  struct Case {
+    std::vector<std::string> arguments;
+    const char* member;
+  } cases[] = {{{"--json", "hello"}, "client_id"},
+               {{"--json", "next-update"}, "seconds"},
+               {{"--json", "icon", "7", "-o", root_.dir() + "/news.png"}, "png_bytes"},
+               {{"--json", "release"}, "released"}};
+  for (const auto& c : cases) {
+    ProcessResult result = sitedeck(c.arguments);
+    ASSERT_TRUE(result.finished) << c.member;
+    EXPECT_EQ(result.exit_code, 0) << c.member << result.err;
+    JsonObject* root = nullptr;
+    UniqueJsonParser parser = ParseJson(result.out, &root);
+    ASSERT_NE(root, nullptr) << c.member;
+    EXPECT_TRUE(json_object_has_member(root, c.member)) << result.out;
+  }
+}
+
+TEST_F(SitedeckTool, NoColourEscapesUnlessStdoutIsATerminalOrColoursAreForced) {
+  for (const auto& arguments :
+       std::vector<std::vector<std::string>>{{"list"},
+                                             {"show", "7"},
+                                             {"--color=auto", "list"},
+                                             {"--json", "--color=always", "list"}}) {
+    ProcessResult result = sitedeck(arguments);
+    EXPECT_EQ(result.exit_code, 0) << arguments[0];
+    EXPECT_EQ(result.out.find('\033'), std::string::npos) << arguments[0] << result.out;
+  }
+  ProcessResult result = sitedeck({"--color=always", "list"});
+  EXPECT_NE(result.out.find("\033[48;2;170;0;0m  \033[0m #AA0000"), std::string::npos)
+      << result.out;
+  result = sitedeck({"show", "7", "--color", "always"});
+  EXPECT_NE(result.out.find("\033[1mdominant colour:\033[0m   \033[48;2;170;0;0m"),
+            std::string::npos)
+      << result.out;
 }
 
 // A pull through the stand-in servers: the result is printed by name, and
