@@ -161,7 +161,7 @@ std::string __server_table(const sds_status_report& report, const sds_tool_setti
   for (const auto& server : report.servers) {
     table.rows.push_back({{"  " + std::to_string(server.id)},
                           {server.base_url},
-                          {std::to_string(server.wait_time) + " s"},
+                          {std::to_string(server.wait_time) + " ms"},
                           {std::to_string(server.retry_count)},
                           {server.fall_back ? "yes" : "no"}});
   }
@@ -222,7 +222,7 @@ bool __print_json(const sds_status_report& report) {
       json_builder_begin_object(b);
       sds_tool_json_int(b, "id", server.id);
       sds_tool_json_text(b, "base_url", server.base_url.c_str());
-      sds_tool_json_int(b, "wait_time", server.wait_time);
+      sds_tool_json_int(b, "wait_time_ms", server.wait_time);
       sds_tool_json_int(b, "retry_count", server.retry_count);
       sds_tool_json_bool(b, "fall_back", server.fall_back);
       json_builder_end_object(b);

@@ -30,9 +30,9 @@ constexpr time_t kDatabaseTime = 1577836800;
 
 const char kServerList[] =
     "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<values>"
-    "<Server><Id>1</Id><Base-url>http://127.0.0.1:8080/</Base-url><WaitTime>5</WaitTime>"
+    "<Server><Id>1</Id><Base-url>http://127.0.0.1:8080/</Base-url><WaitTime>500</WaitTime>"
     "<RetryCount>3</RetryCount><FallBack>false</FallBack></Server>"
-    "<Server><Id>2</Id><Base-url>https://backup.example/deck/</Base-url><WaitTime>60</WaitTime>"
+    "<Server><Id>2</Id><Base-url>https://backup.example/deck/</Base-url><WaitTime>60000</WaitTime>"
     "<RetryCount>1</RetryCount><FallBack>true</FallBack></Server></values>\n";
 
 // Size and modification time of every file below `dir`, to show that
@@ -123,9 +123,9 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
   const std::string data = root_.path(SDS_DATA_DIR);
   const std::string head = "data directory: " + data + "\n" +
                            "servers:        2 configured\n"
-                           "  ID  BASE URL                      WAIT  RETRIES  FALLBACK\n"
-                           "  1   http://127.0.0.1:8080/        5 s   3        no\n"
-                           "  2   https://backup.example/deck/  60 s  1        yes\n"
+                           "  ID  BASE URL                      WAIT      RETRIES  FALLBACK\n"
+                           "  1   http://127.0.0.1:8080/        500 ms    3        no\n"
+                           "  2   https://backup.example/deck/  60000 ms  1        yes\n"
                            "stored ETag:    \"v1-abc\"\n"
                            "next update:    3600 s\n"
                            "last position:  37.500000,127.000000 (Jongno-gu, Seoul)\n"
@@ -151,7 +151,7 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
   JsonObject* backup = json_array_get_object_element(servers, 1);
   EXPECT_EQ(json_object_get_int_member(backup, "id"), 2);
   EXPECT_STREQ(json_object_get_string_member(backup, "base_url"), "https://backup.example/deck/");
-  EXPECT_EQ(json_object_get_int_member(backup, "wait_time"), 60);
+  EXPECT_EQ(json_object_get_int_member(backup, "wait_time_ms"), 60000);
   EXPECT_EQ(json_object_get_int_member(backup, "retry_count"), 1);
   EXPECT_TRUE(json_object_get_boolean_member(backup, "fall_back"));
   EXPECT_STREQ(json_object_get_string_member(root, "etag"), "\"v1-abc\"");

@@ -3,8 +3,14 @@
 // that `icon -o` writes, and how failures and bad usage are reported.
 #include <gtest/gtest.h>
 #include <json-glib/json-glib.h>
+#include <poll.h>
+#include <pty.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <memory>
+#include <regex>
 #include <string>
 #include <vector>
 
@@ -12,6 +18,7 @@
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-utils.h"
+#include "sitedeck-tool-output.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
@@ -248,6 +255,60 @@ TEST_F(SitedeckTool, NoColourEscapesUnlessStdoutIsATerminalOrColoursAreForced) {
   EXPECT_NE(result.out.find("\033[1mdominant colour:\033[0m   \033[48;2;170;0;0m"),
             std::string::npos)
       << result.out;
+}
+
+// Runs the tool on a pseudo-terminal `columns` wide, as a person would, and
+// returns what it printed there (line ends as the terminal makes them).
+std::string RunOnTerminal(const std::vector<std::string>& argv, unsigned short columns) {
+  struct winsize size {};
+  size.ws_row = 24;
+  size.ws_col = columns;
+  int master = -1;
+  pid_t pid = forkpty(&master, nullptr, nullptr, &size);
+  if (pid < 0) return "";
+  if (pid == 0) {
+    setenv("TERM", "xterm-256color", 1);
+    unsetenv("NO_COLOR");
+    std::vector<char*> args;
+    for (const auto& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
+    args.push_back(nullptr);
+    execv(args[0], args.data());
+    _exit(127);
+  }
+  std::string out;
+  char buffer[4096];
+  for (;;) {
+    struct pollfd entry = {master, POLLIN, 0};
+    if (poll(&entry, 1, 20000) != 1) {
+      kill(pid, SIGKILL);
+      break;
+    }
+    ssize_t got = read(master, buffer, sizeof buffer);
+    if (got <= 0) break;  // EIO once the tool has ended
+    out.append(buffer, static_cast<size_t>(got));
+  }
+  close(master);
+  int status = 0;
+  (void)waitpid(pid, &status, 0);
+  return out;
+}
+
+TEST_F(SitedeckTool, OnATerminalTheTableFitsItsWidthAndHasColours) {
+  const std::string out = RunOnTerminal(
+      {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "--socket", service_.socket_path(), "list"},
+      60);
+  EXPECT_NE(out.find("\033[1mID\033[0m"), std::string::npos) << out;
+  EXPECT_NE(out.find("\033[48;2;170;0;0m  \033[0m #AA0000"), std::string::npos) << out;
+  EXPECT_NE(out.find("\r\n5   A very lo\xE2\x80\xA6  https://fi\xE2\x80\xA6  "), std::string::npos) << out;
+  size_t lines = 0;
+  const std::regex escape("\033\\[[0-9;]*m");
+  for (size_t start = 0, end; (end = out.find("\r\n", start)) != std::string::npos;
+       start = end + 2) {
+    std::string line = std::regex_replace(out.substr(start, end - start), escape, "");
+    EXPECT_LE(sds_tool_display_width(line), 60u) << line;
+    ++lines;
+  }
+  EXPECT_EQ(lines, 4u) << out;
 }
 
 // A pull through the stand-in servers: the result is printed by name, and
