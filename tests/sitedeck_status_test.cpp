@@ -208,6 +208,7 @@ TEST_F(SitedeckStatus, BrokenFilesAreExplainedNotFailures) {
   ProcessResult result = Status();
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.err, "");
   EXPECT_EQ(result.out, "data directory: " + root_.path(SDS_DATA_DIR) + "\n" +
                             "servers:        none (no usable server list at " +
                             root_.path(SDS_SERVER_DATA_XML) + ")\n" +
