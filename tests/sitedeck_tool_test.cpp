@@ -344,6 +344,18 @@ TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
   EXPECT_EQ(result.exit_code, 0) << result.err;
   EXPECT_EQ(result.out,
             "pull result: 17 SDS_ERROR_HTTP_NOT_MODIFIED: the stored item list is current\n");
+
+  std::vector<std::string> json_init = init;
+  json_init.insert(json_init.begin() + 1, "--json");
+  result = run_process(json_init);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  JsonObject* root = nullptr;
+  UniqueJsonParser parser = ParseJson(result.out, &root);
+  ASSERT_NE(root, nullptr);
+  EXPECT_EQ(json_object_get_int_member(root, "status"), 17);
+  EXPECT_STREQ(json_object_get_string_member(root, "name"), "SDS_ERROR_HTTP_NOT_MODIFIED");
+  EXPECT_STREQ(json_object_get_string_member(root, "meaning"), "the stored item list is current");
+  EXPECT_TRUE(json_object_get_boolean_member(root, "deck_current"));
 }
 
 }  // namespace
