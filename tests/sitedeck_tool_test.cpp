@@ -299,7 +299,8 @@ TEST_F(SitedeckTool, OnATerminalTheTableFitsItsWidthAndHasColours) {
       60);
   EXPECT_NE(out.find("\033[1mID\033[0m"), std::string::npos) << out;
   EXPECT_NE(out.find("\033[48;2;170;0;0m  \033[0m #AA0000"), std::string::npos) << out;
-  EXPECT_NE(out.find("\r\n5   A very lo\xE2\x80\xA6  https://fi\xE2\x80\xA6  "), std::string::npos) << out;
+  EXPECT_NE(out.find("\r\n5   A very lo\xE2\x80\xA6  https://fi\xE2\x80\xA6  "), std::string::npos)
+      << out;
   size_t lines = 0;
   const std::regex escape("\033\\[[0-9;]*m");
   for (size_t start = 0, end; (end = out.find("\r\n", start)) != std::string::npos;
@@ -349,13 +350,13 @@ TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
   json_init.insert(json_init.begin() + 1, "--json");
   result = run_process(json_init);
   EXPECT_EQ(result.exit_code, 0) << result.err;
-  JsonObject* root = nullptr;
-  UniqueJsonParser parser = ParseJson(result.out, &root);
-  ASSERT_NE(root, nullptr);
-  EXPECT_EQ(json_object_get_int_member(root, "status"), 17);
-  EXPECT_STREQ(json_object_get_string_member(root, "name"), "SDS_ERROR_HTTP_NOT_MODIFIED");
-  EXPECT_STREQ(json_object_get_string_member(root, "meaning"), "the stored item list is current");
-  EXPECT_TRUE(json_object_get_boolean_member(root, "deck_current"));
+  JsonObject* pull = nullptr;
+  UniqueJsonParser parser = ParseJson(result.out, &pull);
+  ASSERT_NE(pull, nullptr);
+  EXPECT_EQ(json_object_get_int_member(pull, "status"), 17);
+  EXPECT_STREQ(json_object_get_string_member(pull, "name"), "SDS_ERROR_HTTP_NOT_MODIFIED");
+  EXPECT_STREQ(json_object_get_string_member(pull, "meaning"), "the stored item list is current");
+  EXPECT_TRUE(json_object_get_boolean_member(pull, "deck_current"));
 }
 
 }  // namespace
