@@ -25,6 +25,7 @@ constexpr size_t kSwatchColumns = 3;
 struct sds_tool_glyph {
   size_t bytes;
   size_t columns;
+  bool unsafe = false;  // a control character or a byte that is no UTF-8
 };
 
 // The next character of `text` at `at`: its length in bytes (an invalid
@@ -36,14 +37,14 @@ sds_tool_glyph __next_glyph(const std::string& text, size_t at) {
                   : (lead >> 4) == 0xE  ? 3
                   : (lead >> 3) == 0x1E ? 4
                                         : 0;
-  if (length == 0 || at + length > text.size()) return {1, 1};
+  if (length == 0 || at + length > text.size()) return {1, 1, true};
   char32_t code = length == 1 ? lead : lead & (0x7F >> length);
   for (size_t i = 1; i < length; ++i) {
     const auto next = static_cast<unsigned char>(text[at + i]);
-    if ((next & 0xC0) != 0x80) return {1, 1};
+    if ((next & 0xC0) != 0x80) return {1, 1, true};
     code = (code << 6) | (next & 0x3F);
   }
-  if (code < 0x20 || code == 0x7F) return {length, 0};
+  if (code < 0x20 || (code >= 0x7F && code <= 0x9F)) return {length, 0, true};
   if (code < 0x7F) return {length, 1};
   // wcwidth knows the wide and zero-width characters only under a UTF-8
   // locale; the process's own may be "C".
@@ -53,6 +54,23 @@ sds_tool_glyph __next_glyph(const std::string& text, size_t at) {
   int columns = wcwidth(static_cast<wchar_t>(code));
   (void)uselocale(previous);
   return {length, columns < 0 ? size_t{1} : static_cast<size_t>(columns)};
+}
+
+// Texts from the network and from files reach the terminal: a control
+// character in a title could move the cursor or retitle the window, so each
+// one (and each byte that is no UTF-8) is shown as "?".
+std::string __printable(const std::string& text) {
+  std::string out;
+  for (size_t at = 0; at < text.size();) {
+    sds_tool_glyph glyph = __next_glyph(text, at);
+    if (glyph.unsafe) {
+      out += '?';
+    } else {
+      out.append(text, at, glyph.bytes);
+    }
+    at += glyph.bytes;
+  }
+  return out;
 }
 
 int __hex_digit(char c) {
@@ -176,7 +194,11 @@ std::string sds_tool_style(const std::string& text, const char* code,
   return std::string("\033[") + code + "m" + text + "\033[0m";
 }
 
-std::string sds_tool_format_table(const sds_tool_table& table, const sds_tool_settings& settings) {
+std::string sds_tool_format_table(const sds_tool_table& given, const sds_tool_settings& settings) {
+  sds_tool_table table = given;
+  for (auto& row : table.rows) {
+    for (auto& cell : row) cell.text = __printable(cell.text);
+  }
   const size_t count = table.header.size();
   std::vector<size_t> widths(count, 0);
   for (size_t i = 0; i < count; ++i) widths[i] = sds_tool_display_width(table.header[i]);
@@ -228,7 +250,7 @@ std::string sds_tool_format_fields(const std::vector<std::pair<std::string, sds_
     std::string key = field.first + ":";
     out += sds_tool_style(key, "1", settings);
     out.append(key_width - sds_tool_display_width(key) + 1, ' ');
-    out += __swatch(field.second, settings) + field.second.text + "\n";
+    out += __swatch(field.second, settings) + __printable(field.second.text) + "\n";
   }
   return out;
 }

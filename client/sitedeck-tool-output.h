@@ -56,6 +56,8 @@ struct sds_tool_table {
   std::vector<std::vector<sds_tool_cell>> rows;
 };
 // The table as lines, columns two blanks apart, the last column unpadded.
+// Control characters and bytes that are no UTF-8 in cells and values print
+// as "?", here and in sds_tool_format_fields.
 std::string sds_tool_format_table(const sds_tool_table& table, const sds_tool_settings& settings);
 
 // Aligned "key: value" lines; a value may carry a swatch as a cell does.

@@ -29,6 +29,8 @@ namespace {
 
 // The ETag and the duration are short texts; anything longer is not theirs.
 constexpr long kSmallFileCap = 4096;
+// Longest wait for a database another process is writing.
+constexpr int kBusyWaitMs = 2000;
 
 struct SqliteClose {
   void operator()(sqlite3* db) const noexcept { (void)sqlite3_close(db); }
@@ -136,6 +138,8 @@ void __gather_database(sds_status_report* report) {
   sqlite3* raw = nullptr;
   int rc = sqlite3_open_v2(report->database_path.c_str(), &raw, SQLITE_OPEN_READONLY, nullptr);
   UniqueSqlite db(raw);
+  // A service writing at this moment holds the lock briefly; wait that long.
+  if (rc == SQLITE_OK) (void)sqlite3_busy_timeout(raw, kBusyWaitMs);
   if (rc != SQLITE_OK || !__count_items(raw, 1, &report->live_items) ||
       !__count_items(raw, -1, &report->hidden_items)) {
     report->database_problem = raw != nullptr ? sqlite3_errmsg(raw) : sqlite3_errstr(rc);

@@ -126,6 +126,19 @@ TEST(ToolOutput, TableWithColoursHasABoldHeaderAndSwatchesForValidColours) {
             "12  Mail             -\n");
 }
 
+TEST(ToolOutput, ControlCharactersFromTheNetworkCannotReachTheTerminal) {
+  sds_tool_table table;
+  table.header = {"ID", "TITLE"};
+  table.rows = {{{"1"},
+                 {"Evil\033]2;owned\007 \xC2\x9B"
+                  "31m\xFFTitle"}}};
+  EXPECT_EQ(sds_tool_format_table(table, sds_tool_settings{}),
+            "ID  TITLE\n"
+            "1   Evil?]2;owned? ?31m?Title\n");
+  EXPECT_EQ(sds_tool_format_fields({{"city", {"Jongno\r\n-gu"}}}, sds_tool_settings{}),
+            "city: Jongno?" "?-gu\n");
+}
+
 TEST(ToolOutput, FieldsAlignTheirValues) {
   EXPECT_EQ(sds_tool_format_fields({{"id", {"3"}}, {"dominant colour", {"#00FF00", true}}},
                                    sds_tool_settings{}),
