@@ -136,7 +136,8 @@ TEST(ToolOutput, ControlCharactersFromTheNetworkCannotReachTheTerminal) {
             "ID  TITLE\n"
             "1   Evil?]2;owned? ?31m?Title\n");
   EXPECT_EQ(sds_tool_format_fields({{"city", {"Jongno\r\n-gu"}}}, sds_tool_settings{}),
-            "city: Jongno?" "?-gu\n");
+            "city: Jongno?"
+            "?-gu\n");
 }
 
 TEST(ToolOutput, FieldsAlignTheirValues) {
