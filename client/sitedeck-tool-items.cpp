@@ -1,7 +1,8 @@
 // The `sitedeck` subcommands that show the stored deck: `list` (a table of the
 // live items), `show ID` (every field of one item) and `icon ID -o FILE`
 // (the item's pixels written back out as a PNG file).
-#include <algorithm>
+#include <json-glib/json-glib.h>
+
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -10,33 +11,15 @@
 #include <vector>
 
 #include "sitedeck-client-deck.h"
+#include "sitedeck-client-status-text.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-utils.h"
+#include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 
 namespace {
 
-// Longest title and URL the table shows, in characters; longer ones are cut.
-constexpr size_t kTitleColumnMax = 32;
-constexpr size_t kUrlColumnMax = 48;
 constexpr char kMissing[] = "-";
-
-// Characters of a UTF-8 text: bytes that do not continue a sequence.
-size_t __utf8_length(const std::string& text) {
-  size_t count = 0;
-  for (unsigned char c : text) count += (c & 0xC0) != 0x80;
-  return count;
-}
-
-// `text` cut to at most `max` characters, "..." marking a cut.
-std::string __fit(const std::string& text, size_t max) {
-  if (__utf8_length(text) <= max) return text;
-  size_t keep = max - 3, seen = 0, end = 0;
-  for (; end < text.size(); ++end) {
-    if ((static_cast<unsigned char>(text[end]) & 0xC0) != 0x80 && seen++ == keep) break;
-  }
-  return text.substr(0, end) + "...";
-}
 
 std::string __text_or_missing(const UniqueCStr& value) { return value ? value.get() : kMissing; }
 
@@ -47,14 +30,24 @@ std::string __flags(const sds_client_item& item) {
   return flags.empty() ? kMissing : flags;
 }
 
-// Left-aligned cells padded to `widths`, the last one unpadded.
-void __print_row(const std::vector<std::string>& cells, const std::vector<size_t>& widths) {
-  std::string line;
-  for (size_t i = 0; i < cells.size(); ++i) {
-    line += cells[i];
-    if (i + 1 < cells.size()) line.append(widths[i] - __utf8_length(cells[i]) + 2, ' ');
+// A flag member: its value when the service had one, else null.
+void __json_flag(JsonBuilder* builder, const char* name, int status, int32_t value) {
+  if (status == SDS_ERROR_NONE) {
+    sds_tool_json_int(builder, name, value);
+  } else {
+    sds_tool_json_null(builder, name);
   }
-  std::printf("%s\n", line.c_str());
+}
+
+// The item's stored fields as members of the open object.
+void __json_item_fields(JsonBuilder* builder, const sds_client_item& item) {
+  sds_tool_json_int(builder, "id", item.id);
+  sds_tool_json_text(builder, "url", item.url.get());
+  sds_tool_json_text(builder, "title", item.title.get());
+  sds_tool_json_text(builder, "dominant_color", item.dominant_color.get());
+  sds_tool_json_text(builder, "icon_size", item.icon_size.get());
+  __json_flag(builder, "touch_icon_exists", item.touch_icon_status, item.touch_icon_exists);
+  __json_flag(builder, "favicon_exists", item.favicon_status, item.favicon_exists);
 }
 
 }  // namespace
@@ -65,21 +58,33 @@ int sds_tool_list(SdsConnection& connection, int argc, char** /*argv*/) {
   int status = sds_client_get_full_ids(connection, &ids);
   if (status != SDS_ERROR_NONE && status != SDS_ERROR_NO_DATA) return status;
 
-  std::vector<std::vector<std::string>> rows = {{"ID", "TITLE", "URL", "COLOUR", "ICON", "FLAGS"}};
+  const sds_tool_settings& output = sds_tool_output();
+  UniqueJsonBuilder json = sds_tool_json_builder();
+  json_builder_begin_object(json.get());
+  json_builder_set_member_name(json.get(), "items");
+  json_builder_begin_array(json.get());
+  sds_tool_table table;
+  table.header = {"ID", "TITLE", "URL", "COLOUR", "ICON", "FLAGS"};
+  table.shrinkable = {false, true, true, false, false, false};
   for (int32_t i = 0; i < ids.count; ++i) {
     sds_client_item item;
     status = sds_client_read_item(connection, ids.ids.get()[i], false, &item);
     if (status != SDS_ERROR_NONE) return status;
-    rows.push_back({std::to_string(item.id), __fit(__text_or_missing(item.title), kTitleColumnMax),
-                    __fit(__text_or_missing(item.url), kUrlColumnMax),
-                    __text_or_missing(item.dominant_color), __text_or_missing(item.icon_size),
-                    __flags(item)});
+    json_builder_begin_object(json.get());
+    __json_item_fields(json.get(), item);
+    json_builder_end_object(json.get());
+    table.rows.push_back({{std::to_string(item.id)},
+                          {__text_or_missing(item.title)},
+                          {__text_or_missing(item.url)},
+                          {__text_or_missing(item.dominant_color), true},
+                          {__text_or_missing(item.icon_size)},
+                          {__flags(item)}});
   }
-  std::vector<size_t> widths(rows[0].size(), 0);
-  for (const auto& row : rows) {
-    for (size_t i = 0; i < row.size(); ++i) widths[i] = std::max(widths[i], __utf8_length(row[i]));
-  }
-  for (const auto& row : rows) __print_row(row, widths);
+  json_builder_end_array(json.get());
+  json_builder_end_object(json.get());
+  if (output.json) return sds_tool_json_print(json.get()) ? SDS_ERROR_NONE : kSdsToolReported;
+  std::string text = sds_tool_format_table(table, output);
+  std::fwrite(text.data(), 1, text.size(), stdout);
   return SDS_ERROR_NONE;
 }
 
@@ -89,33 +94,61 @@ int sds_tool_show(SdsConnection& connection, int argc, char** argv) {
   sds_client_item item;
   int status = sds_client_read_item(connection, id, false, &item);
   if (status != SDS_ERROR_NONE) return status;
+  // The pixels are asked for on their own: an icon the service can't hand
+  // over is a fact about the item, not a failure of `show`.
+  sds_client_icon icon;
+  int icon_status = sds_client_get_icon(connection, id, &icon);
+  if (icon_status != SDS_ERROR_NONE && icon_status != SDS_ERROR_NO_DATA && !connection.is_open()) {
+    return icon_status;
+  }
+
+  const sds_tool_settings& output = sds_tool_output();
+  if (output.json) {
+    UniqueJsonBuilder json = sds_tool_json_builder();
+    json_builder_begin_object(json.get());
+    __json_item_fields(json.get(), item);
+    json_builder_set_member_name(json.get(), "icon");
+    if (icon_status == SDS_ERROR_NONE) {
+      json_builder_begin_object(json.get());
+      sds_tool_json_int(json.get(), "width", icon.width);
+      sds_tool_json_int(json.get(), "height", icon.height);
+      sds_tool_json_int(json.get(), "bytes", icon.byte_count);
+      json_builder_end_object(json.get());
+    } else {
+      json_builder_add_null_value(json.get());
+    }
+    if (icon_status != SDS_ERROR_NONE && icon_status != SDS_ERROR_NO_DATA) {
+      sds_tool_json_int(json.get(), "icon_status", icon_status);
+    }
+    json_builder_end_object(json.get());
+    return sds_tool_json_print(json.get()) ? SDS_ERROR_NONE : kSdsToolReported;
+  }
+
   auto flag = [](int field_status, int32_t value) {
     return field_status == SDS_ERROR_NONE ? std::to_string(value) : std::string("(none)");
   };
   auto text = [](const UniqueCStr& value) { return value ? value.get() : "(none)"; };
-  std::printf("id:                %d\n", item.id);
-  std::printf("url:               %s\n", text(item.url));
-  std::printf("title:             %s\n", text(item.title));
-  std::printf("dominant colour:   %s\n", text(item.dominant_color));
-  std::printf("icon size:         %s\n", text(item.icon_size));
-  std::printf("touch icon exists: %s\n",
-              flag(item.touch_icon_status, item.touch_icon_exists).c_str());
-  std::printf("favicon exists:    %s\n", flag(item.favicon_status, item.favicon_exists).c_str());
-  // The pixels are asked for on their own: an icon the service can't hand
-  // over is a fact about the item, not a failure of `show`.
-  sds_client_icon icon;
-  status = sds_client_get_icon(connection, id, &icon);
-  if (status == SDS_ERROR_NONE) {
-    std::printf("icon pixels:       %dx%d, %d bytes\n", icon.width, icon.height, icon.byte_count);
-  } else if (status == SDS_ERROR_NO_DATA) {
-    std::printf("icon pixels:       (none)\n");
-  } else if (connection.is_open()) {
-    std::printf("icon pixels:       unavailable: ");
-    sds_tool_print_status(stdout, status);
-    std::printf("\n");
-  } else {
-    return status;
+  std::string pixels = "(none)";
+  if (icon_status == SDS_ERROR_NONE) {
+    pixels = std::to_string(icon.width) + "x" + std::to_string(icon.height) + ", " +
+             std::to_string(icon.byte_count) + " bytes";
+  } else if (icon_status != SDS_ERROR_NO_DATA) {
+    pixels = std::string("unavailable: ") + std::to_string(icon_status) + " " +
+             sds_client_status_name(icon_status) + ": " + sds_client_status_meaning(icon_status);
   }
+  std::string lines = sds_tool_format_fields(
+      {
+          {"id", {std::to_string(item.id)}},
+          {"url", {text(item.url)}},
+          {"title", {text(item.title)}},
+          {"dominant colour", {text(item.dominant_color), true}},
+          {"icon size", {text(item.icon_size)}},
+          {"touch icon exists", {flag(item.touch_icon_status, item.touch_icon_exists)}},
+          {"favicon exists", {flag(item.favicon_status, item.favicon_exists)}},
+          {"icon pixels", {pixels}},
+      },
+      output);
+  std::fwrite(lines.data(), 1, lines.size(), stdout);
   return SDS_ERROR_NONE;
 }
 
@@ -153,6 +186,16 @@ int sds_tool_icon(SdsConnection& connection, int argc, char** argv) {
   if (!written || std::fclose(file.release()) != 0) {
     std::fprintf(stderr, "sitedeck: icon: cannot write %s: %s\n", output, std::strerror(errno));
     return kSdsToolReported;
+  }
+  if (sds_tool_output().json) {
+    UniqueJsonBuilder json = sds_tool_json_builder();
+    json_builder_begin_object(json.get());
+    sds_tool_json_text(json.get(), "file", output);
+    sds_tool_json_int(json.get(), "width", icon.width);
+    sds_tool_json_int(json.get(), "height", icon.height);
+    sds_tool_json_int(json.get(), "png_bytes", png_size);
+    json_builder_end_object(json.get());
+    return sds_tool_json_print(json.get()) ? SDS_ERROR_NONE : kSdsToolReported;
   }
   std::printf("%s: %dx%d, %d bytes of PNG\n", output, icon.width, icon.height, png_size);
   return SDS_ERROR_NONE;

@@ -8,9 +8,12 @@
 #include <ctime>
 #include <vector>
 
+#include <json-glib/json-glib.h>
+
 #include "sitedeck-client-deck.h"
 #include "sitedeck-client-page.h"
 #include "sitedeck-service-utils.h"
+#include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 
 namespace {
@@ -117,6 +120,14 @@ int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
     return kSdsToolReported;
   }
   if (status != SDS_ERROR_NONE) return status;
+  if (sds_tool_output().json) {
+    UniqueJsonBuilder json = sds_tool_json_builder();
+    json_builder_begin_object(json.get());
+    sds_tool_json_text(json.get(), "path", path.get());
+    sds_tool_json_int(json.get(), "tiles", static_cast<long long>(count));
+    json_builder_end_object(json.get());
+    return sds_tool_json_print(json.get()) ? SDS_ERROR_NONE : kSdsToolReported;
+  }
   std::printf("%s\n", path.get());
   return SDS_ERROR_NONE;
 }

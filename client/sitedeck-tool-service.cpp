@@ -1,6 +1,7 @@
 // The `sitedeck` subcommands about the service itself rather than one item:
 // `hello`, `next-update`, `release` and `init` (a data pull, with a spinner
 // on a terminal while it runs), and the argument and status helpers.
+#include <json-glib/json-glib.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -12,13 +13,15 @@
 #include <cstring>
 
 #include "sitedeck-client-commands.h"
+#include "sitedeck-client-status-text.h"
 #include "sitedeck-service-ipc.h"
+#include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 
 namespace {
 
-// What a pull's result means to the person who asked for it. sds_error_string
-// names several of these "SDS_ERROR_UNKNOWN", a text peers rely on.
+// What a pull's result means to the person who asked for it; the general
+// meaning of a status says less about a pull than this.
 const char* __pull_meaning(int status) {
   switch (status) {
     case SDS_ERROR_NONE:
@@ -31,11 +34,18 @@ const char* __pull_meaning(int status) {
       return "the server moved and could not be reached";
     case SDS_ERROR_DATA_PULL_FAILED:
       return "no pull possible (no server list or request URL)";
-    case SDS_ERROR_DB_OPEN_FAILED:
-      return "the database could not be opened";
     default:
-      return "the pull failed";
+      return sds_client_status_meaning(status);
   }
+}
+
+// One-member documents of the simple commands.
+bool __print_json_int(const char* name, long long value) {
+  UniqueJsonBuilder json = sds_tool_json_builder();
+  json_builder_begin_object(json.get());
+  sds_tool_json_int(json.get(), name, value);
+  json_builder_end_object(json.get());
+  return sds_tool_json_print(json.get());
 }
 
 struct sds_tool_spinner {
@@ -77,11 +87,27 @@ bool sds_tool_parse_double(const char* text, double* value) {
 }
 
 void sds_tool_print_status(FILE* out, int status) {
-  std::fprintf(out, "%s (%d)", sds_error_string(status), status);
+  std::fprintf(out, "%d %s: %s", status, sds_client_status_name(status),
+               sds_client_status_meaning(status));
+}
+
+void sds_tool_report_status(int status) {
+  // The library gives 1 for a connection that broke as much as for a
+  // service that sent it: both mean the connection is gone.
+  if (status == SDS_ERROR_IO_ERROR) {
+    std::fprintf(stderr, "sitedeck: lost the connection to the service: ");
+  } else {
+    std::fprintf(stderr, "sitedeck: the service answered ");
+  }
+  sds_tool_print_status(stderr, status);
+  std::fprintf(stderr, "\n");
 }
 
 int sds_tool_hello(SdsConnection& connection, int argc, char** /*argv*/) {
   if (argc != 0) return kSdsToolUsage;
+  if (sds_tool_output().json) {
+    return __print_json_int("client_id", connection.cid()) ? SDS_ERROR_NONE : kSdsToolReported;
+  }
   std::printf("client id: %d\n", connection.cid());
   return SDS_ERROR_NONE;
 }
@@ -91,6 +117,9 @@ int sds_tool_next_update(SdsConnection& connection, int argc, char** /*argv*/) {
   int32_t seconds = 0;
   int status = sds_client_get_next_update_duration(connection, &seconds);
   if (status != SDS_ERROR_NONE) return status;
+  if (sds_tool_output().json) {
+    return __print_json_int("seconds", seconds) ? SDS_ERROR_NONE : kSdsToolReported;
+  }
   std::printf("%d\n", seconds);
   return SDS_ERROR_NONE;
 }
@@ -99,6 +128,13 @@ int sds_tool_release(SdsConnection& connection, int argc, char** /*argv*/) {
   if (argc != 0) return kSdsToolUsage;
   int status = sds_client_release_shm(connection);
   if (status != SDS_ERROR_NONE) return status;
+  if (sds_tool_output().json) {
+    UniqueJsonBuilder json = sds_tool_json_builder();
+    json_builder_begin_object(json.get());
+    sds_tool_json_bool(json.get(), "released", true);
+    json_builder_end_object(json.get());
+    return sds_tool_json_print(json.get()) ? SDS_ERROR_NONE : kSdsToolReported;
+  }
   std::printf("shared memory released\n");
   return SDS_ERROR_NONE;
 }
@@ -131,10 +167,26 @@ int sds_tool_init(SdsConnection& connection, int argc, char** argv) {
   // Status 1 is what a connection lost during the pull looks like, not a
   // result the service sent.
   if (status == SDS_ERROR_IO_ERROR || status == SDS_ERROR_IO_EINTR) return status;
-  std::printf("pull result: ");
-  sds_tool_print_status(stdout, status);
-  std::printf(": %s\n", __pull_meaning(status));
   // Both outcomes leave a current deck behind.
-  if (status == SDS_ERROR_NONE || status == SDS_ERROR_HTTP_NOT_MODIFIED) return SDS_ERROR_NONE;
+  bool current = status == SDS_ERROR_NONE || status == SDS_ERROR_HTTP_NOT_MODIFIED;
+  if (sds_tool_output().json) {
+    UniqueJsonBuilder json = sds_tool_json_builder();
+    json_builder_begin_object(json.get());
+    sds_tool_json_int(json.get(), "status", status);
+    sds_tool_json_text(json.get(), "name", sds_client_status_name(status));
+    sds_tool_json_text(json.get(), "meaning", __pull_meaning(status));
+    sds_tool_json_bool(json.get(), "deck_current", current);
+    json_builder_end_object(json.get());
+    if (!sds_tool_json_print(json.get())) return kSdsToolReported;
+  } else {
+    std::printf("pull result: %d %s: %s\n", status, sds_client_status_name(status),
+                __pull_meaning(status));
+  }
+  if (current) return SDS_ERROR_NONE;
+  if (sds_tool_output().json) {
+    std::fprintf(stderr, "sitedeck: the pull failed: ");
+    sds_tool_print_status(stderr, status);
+    std::fprintf(stderr, "\n");
+  }
   return kSdsToolReported;
 }

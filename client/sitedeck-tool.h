@@ -19,6 +19,9 @@ struct sds_tool_command {
   const char* arguments;
   const char* help;
   int (*run)(SdsConnection& connection, int argc, char** argv);
+  // Works from the files alone: the driver does not connect, and `run` gets
+  // a connection that is not open.
+  bool offline = false;
 };
 
 int sds_tool_hello(SdsConnection& connection, int argc, char** argv);
@@ -29,10 +32,18 @@ int sds_tool_next_update(SdsConnection& connection, int argc, char** argv);
 int sds_tool_release(SdsConnection& connection, int argc, char** argv);
 int sds_tool_init(SdsConnection& connection, int argc, char** argv);
 int sds_tool_render(SdsConnection& connection, int argc, char** argv);
+int sds_tool_status(SdsConnection& connection, int argc, char** argv);
 
 // Parses a whole decimal item id (0 to INT32_MAX); false for anything else.
 bool sds_tool_parse_id(const char* text, int32_t* id);
 // Parses a whole decimal number (a coordinate); false for anything else.
 bool sds_tool_parse_double(const char* text, double* value);
-// "NAME (N)" for an SDS code, NAME being sds_error_string's text.
+// "N NAME: meaning" for an SDS code, NAME being the constant's own name.
 void sds_tool_print_status(FILE* out, int status);
+// Tells the user on stderr what a non-zero status from the service (or a
+// lost connection, status 1) means, as one "sitedeck: ..." line.
+void sds_tool_report_status(int status);
+
+// The help of one subcommand: synopsis, what it does, its options, an
+// example and its exit statuses.
+void sds_tool_print_command_help(FILE* out, const sds_tool_command& command);

@@ -2,16 +2,24 @@
 // one subcommand per request or screenful, so the service can be tried and
 // scripted without a browser. Each subcommand is one row of kCommands; exit
 // status 0 on success, 1 when the service or the connection failed (the
-// status is printed by name and number), 2 for bad usage.
+// status is printed by number, name and meaning), 2 for bad usage.
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cerrno>
 #include <csignal>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "dlog.h"
 #include "sitedeck-client.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
+#include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 
 namespace {
@@ -31,6 +39,8 @@ constexpr sds_tool_command kCommands[] = {
     {"release", "", "remove the shared-memory object (ends the connection)", sds_tool_release},
     {"init", "--lat LAT --lon LON [--version V]",
      "run a data pull; exit 0 when the deck is current afterwards", sds_tool_init},
+    {"status", "", "what is stored under the data directory (no service needed)", sds_tool_status,
+     true},
     {"render", "OUT_DIR", "write the deck as a start page to OUT_DIR/index.html", sds_tool_render},
 };
 
@@ -38,22 +48,41 @@ struct sds_tool_options {
   std::string socket_path = sds_path(SDS_SOCKET_PATH);
   int timeout_ms = kDefaultTimeoutMs;
   bool verbose = false;
+  bool json = false;
+  sds_tool_color_mode color = sds_tool_color_mode::automatic;
 };
+
+// What the driver does after reading the options before the command.
+enum class sds_tool_parse { command, help, bad };
 
 void __sds_tool_usage(FILE* out) {
   std::fprintf(out,
                "usage: sitedeck [OPTIONS] COMMAND [ARGUMENTS]\n"
+               "Talks to the site deck service the way the browser does.\n\n"
                "options:\n"
-               "  --socket PATH  the service's socket (default %s)\n"
-               "  --timeout MS   give up on a reply after MS milliseconds (default %d;\n"
-               "                 0 waits forever; a pull's result is always awaited)\n"
-               "  --verbose      show the protocol library's log lines\n"
+               "  --socket PATH   the service's socket (default %s)\n"
+               "  --timeout MS    give up on a reply after MS milliseconds (default %d;\n"
+               "                  0 waits forever; a pull's result is always awaited)\n"
+               "  --json          print one JSON document instead of text\n"
+               "  --color=WHEN    colours: auto (on a terminal, unless NO_COLOR is set\n"
+               "                  or TERM is dumb), always or never\n"
+               "  --verbose       show the protocol library's log lines\n"
+               "  -h, --help      show this help\n\n"
                "commands:\n",
                sds_path(SDS_SOCKET_PATH).c_str(), kDefaultTimeoutMs);
   for (const auto& command : kCommands) {
     std::string synopsis = std::string(command.name) + " " + command.arguments;
-    std::fprintf(out, "  %-46s %s\n", synopsis.c_str(), command.help);
+    std::fprintf(out, "  %-40s %s\n", synopsis.c_str(), command.help);
   }
+  std::fprintf(out,
+               "  %-40s %s\n\n"
+               "Run 'sitedeck help COMMAND' or 'sitedeck COMMAND --help' for one command.\n"
+               "exit status: 0 success, 1 the service or the connection failed, 2 bad usage\n",
+               "help [COMMAND]", "this help, or the help of COMMAND");
+}
+
+void __sds_tool_hint(const char* what) {
+  std::fprintf(stderr, "sitedeck: %s\nTry 'sitedeck --help' for more information.\n", what);
 }
 
 const sds_tool_command* __sds_tool_find(const char* name) {
@@ -63,31 +92,115 @@ const sds_tool_command* __sds_tool_find(const char* name) {
   return nullptr;
 }
 
-// Reads the options before the command; returns the index of the command
-// name, argc when there is none, or -1 after an unusable option (-2: --help).
-int __sds_tool_parse_options(int argc, char** argv, sds_tool_options* options) {
-  int index = 1;
-  while (index < argc && argv[index][0] == '-') {
-    const char* option = argv[index];
-    const char* value = index + 1 < argc ? argv[index + 1] : nullptr;
+// Takes --json and --color from argv[index]; returns how many arguments it
+// used (0: not one of them, -1: a --color with a value that is not a mode).
+int __sds_tool_output_option(int argc, char** argv, int index, sds_tool_options* options) {
+  const char* option = argv[index];
+  if (std::strcmp(option, "--json") == 0) {
+    options->json = true;
+    return 1;
+  }
+  if (std::strncmp(option, "--color=", 8) == 0) {
+    return sds_tool_parse_color_mode(option + 8, &options->color) ? 1 : -1;
+  }
+  if (std::strcmp(option, "--color") == 0) {
+    if (index + 1 >= argc) return -1;
+    return sds_tool_parse_color_mode(argv[index + 1], &options->color) ? 2 : -1;
+  }
+  return 0;
+}
+
+// Reads the options before the command and sets `*index` to the command's
+// place (argc when there is none).
+sds_tool_parse __sds_tool_parse_options(int argc, char** argv, sds_tool_options* options,
+                                        int* index) {
+  int at = 1;
+  while (at < argc && argv[at][0] == '-') {
+    const char* option = argv[at];
+    const char* value = at + 1 < argc ? argv[at + 1] : nullptr;
     int32_t number = 0;
-    if (std::strcmp(option, "--socket") == 0 && value != nullptr) {
+    int used = __sds_tool_output_option(argc, argv, at, options);
+    if (used > 0) {
+      at += used;
+    } else if (used < 0) {
+      __sds_tool_hint("--color takes auto, always or never");
+      return sds_tool_parse::bad;
+    } else if (std::strcmp(option, "--socket") == 0 && value != nullptr) {
       options->socket_path = value;
-      index += 2;
+      at += 2;
     } else if (std::strcmp(option, "--timeout") == 0 && sds_tool_parse_id(value, &number)) {
       options->timeout_ms = number;
-      index += 2;
+      at += 2;
     } else if (std::strcmp(option, "--verbose") == 0) {
       options->verbose = true;
-      index += 1;
+      at += 1;
     } else if (std::strcmp(option, "--help") == 0 || std::strcmp(option, "-h") == 0) {
-      return -2;
+      return sds_tool_parse::help;
     } else {
-      std::fprintf(stderr, "sitedeck: unknown or incomplete option %s\n", option);
-      return -1;
+      std::string what = std::string("unknown or incomplete option ") + option;
+      __sds_tool_hint(what.c_str());
+      return sds_tool_parse::bad;
     }
   }
-  return index;
+  *index = at;
+  return sds_tool_parse::command;
+}
+
+// `sitedeck help [COMMAND]`.
+int __sds_tool_help_command(int argc, char** argv) {
+  if (argc == 0) {
+    __sds_tool_usage(stdout);
+    return 0;
+  }
+  const sds_tool_command* command = __sds_tool_find(argv[0]);
+  if (argc > 1 || command == nullptr) {
+    std::string what = std::string("no help for ") + argv[0] + ": not a command";
+    __sds_tool_hint(what.c_str());
+    return 2;
+  }
+  sds_tool_print_command_help(stdout, *command);
+  return 0;
+}
+
+// Why connecting failed, in words: the library only says that it did, so
+// the connection is tried once more here to learn the system's reason.
+std::string __sds_tool_unreachable_reason(const std::string& path, int status) {
+  if (status == SDS_ERROR_INVALID_PARAMETER) return "the socket path is too long";
+  struct sockaddr_un address {};
+  address.sun_family = AF_UNIX;
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  if (!fd) return std::strerror(errno);
+  int result = 0;
+  do {
+    result = connect(fd.get(), reinterpret_cast<const struct sockaddr*>(&address), sizeof address);
+  } while (result != 0 && errno == EINTR);
+  if (result == 0) return "the service closed the connection before its greeting";
+  switch (errno) {
+    case ENOENT:
+      return "there is no socket file";
+    case ECONNREFUSED:
+      return "nobody is listening on the socket";
+    case EACCES:
+    case EPERM:
+      return "permission denied";
+    default:
+      return std::strerror(errno);
+  }
+}
+
+void __sds_tool_report_connect(const std::string& path, int status) {
+  // A greeting with a non-zero status is the service refusing the client.
+  if (status != SDS_ERROR_IO_ERROR && status != SDS_ERROR_INVALID_PARAMETER) {
+    std::fprintf(stderr, "sitedeck: the service refused the connection: ");
+    sds_tool_print_status(stderr, status);
+    std::fprintf(stderr, "\n");
+    return;
+  }
+  std::fprintf(stderr,
+               "sitedeck: cannot reach the site deck service at %s: %s (is the socket unit "
+               "running?)\n",
+               path.c_str(), __sds_tool_unreachable_reason(path, status).c_str());
 }
 
 }  // namespace
@@ -96,44 +209,72 @@ int main(int argc, char** argv) {
   // A service that goes away must turn into an error message, not a signal.
   (void)std::signal(SIGPIPE, SIG_IGN);
   sds_tool_options options;
-  int index = __sds_tool_parse_options(argc, argv, &options);
-  if (index == -2) {
+  int index = argc;
+  sds_tool_parse parsed = __sds_tool_parse_options(argc, argv, &options, &index);
+  if (parsed == sds_tool_parse::help) {
     __sds_tool_usage(stdout);
     return 0;
   }
-  if (index < 0 || index >= argc) {
-    __sds_tool_usage(stderr);
+  if (parsed == sds_tool_parse::bad) return 2;
+  if (index >= argc) {
+    __sds_tool_hint("no command given");
     return 2;
+  }
+  if (std::strcmp(argv[index], "help") == 0) {
+    return __sds_tool_help_command(argc - index - 1, argv + index + 1);
   }
   const sds_tool_command* command = __sds_tool_find(argv[index]);
   if (command == nullptr) {
-    std::fprintf(stderr, "sitedeck: unknown command %s\n", argv[index]);
-    __sds_tool_usage(stderr);
+    std::string what = std::string("unknown command ") + argv[index];
+    __sds_tool_hint(what.c_str());
     return 2;
   }
+  // The output options may follow the command too; the rest is the
+  // command's own.
+  std::vector<char*> arguments;
+  for (int at = index + 1; at < argc;) {
+    if (std::strcmp(argv[at], "--help") == 0 || std::strcmp(argv[at], "-h") == 0) {
+      sds_tool_print_command_help(stdout, *command);
+      return 0;
+    }
+    int used = __sds_tool_output_option(argc, argv, at, &options);
+    if (used < 0) {
+      __sds_tool_hint("--color takes auto, always or never");
+      return 2;
+    }
+    if (used == 0) arguments.push_back(argv[at]);
+    at += used > 0 ? used : 1;
+  }
+  arguments.push_back(nullptr);
+
+  sds_tool_settings& output = sds_tool_output();
+  output.json = options.json;
+  output.color =
+      !options.json && sds_tool_decide_color(options.color, isatty(STDOUT_FILENO) == 1,
+                                             std::getenv("NO_COLOR"), std::getenv("TERM"));
+  output.columns = options.json ? 0 : sds_tool_terminal_columns(STDOUT_FILENO);
   // The library logs every failed read and write; a person wants one line.
   dlog_set_quiet(!options.verbose);
 
   SdsConnection connection;
-  int read_timeout_ms = (options.timeout_ms + kReadAttempts - 1) / kReadAttempts;
-  int status = sds_client_connect(options.socket_path, &connection, read_timeout_ms);
-  if (status != SDS_ERROR_NONE) {
-    std::fprintf(stderr, "sitedeck: %s: cannot connect to %s: ", command->name,
-                 options.socket_path.c_str());
-    sds_tool_print_status(stderr, status);
-    std::fprintf(stderr, "\n");
-    return 1;
+  if (!command->offline) {
+    int read_timeout_ms = (options.timeout_ms + kReadAttempts - 1) / kReadAttempts;
+    int status = sds_client_connect(options.socket_path, &connection, read_timeout_ms);
+    if (status != SDS_ERROR_NONE) {
+      __sds_tool_report_connect(options.socket_path, status);
+      return 1;
+    }
   }
-  status = command->run(connection, argc - index - 1, argv + index + 1);
+  int status = command->run(connection, static_cast<int>(arguments.size()) - 1, arguments.data());
   if (status == kSdsToolUsage) {
-    std::fprintf(stderr, "usage: sitedeck %s %s\n", command->name, command->arguments);
+    std::fprintf(stderr, "usage: sitedeck %s%s%s\nTry 'sitedeck %s --help' for more information.\n",
+                 command->name, command->arguments[0] != '\0' ? " " : "", command->arguments,
+                 command->name);
     return 2;
   }
   if (status == kSdsToolReported) return 1;
   if (status != SDS_ERROR_NONE) {
-    std::fprintf(stderr, "sitedeck: %s: ", command->name);
-    sds_tool_print_status(stderr, status);
-    std::fprintf(stderr, "\n");
+    sds_tool_report_status(status);
     return 1;
   }
   return 0;

@@ -253,6 +253,8 @@ TEST_F(RenderTool, OversizedDeckIsCutToTheFirstThousandTiles) {
 }
 
 TEST_F(RenderTool, BadUsageAndUnwritableDirectoryAreReported) {
+  const std::string kRenderUsage =
+      "usage: sitedeck render OUT_DIR\nTry 'sitedeck render --help' for more information.\n";
   ASSERT_TRUE(seed_deck({seed_item(1, "https://a.example/", "A", 1)}));
   ASSERT_TRUE(service_.start_activated(/*once=*/false));
   const std::string file = root_.dir() + "/plain-file";
@@ -262,9 +264,9 @@ TEST_F(RenderTool, BadUsageAndUnwritableDirectoryAreReported) {
     int exit_code;
     std::string err;
   } cases[] = {
-      {{"render"}, 2, "usage: sitedeck render OUT_DIR\n"},
-      {{"render", "a", "b"}, 2, "usage: sitedeck render OUT_DIR\n"},
-      {{"render", "--bogus"}, 2, "usage: sitedeck render OUT_DIR\n"},
+      {{"render"}, 2, kRenderUsage},
+      {{"render", "a", "b"}, 2, kRenderUsage},
+      {{"render", "--bogus"}, 2, kRenderUsage},
       {{"render", file}, 1, "sitedeck: render: cannot create " + file + ": Not a directory\n"},
   };
   for (const auto& c : cases) {

@@ -2,7 +2,15 @@
 // with a seeded database: the table of `list`, the fields of `show`, the PNG
 // that `icon -o` writes, and how failures and bad usage are reported.
 #include <gtest/gtest.h>
+#include <json-glib/json-glib.h>
+#include <poll.h>
+#include <pty.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
+#include <memory>
+#include <regex>
 #include <string>
 #include <vector>
 
@@ -10,6 +18,7 @@
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-utils.h"
+#include "sitedeck-tool-output.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
@@ -55,14 +64,16 @@ TEST_F(SitedeckTool, ListPrintsTheLiveItemsInDeckOrder) {
   ProcessResult result = sitedeck({"list"});
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 0) << result.err;
-  EXPECT_EQ(
-      result.out,
-      "ID  TITLE                             URL                         COLOUR   ICON  FLAGS\n"
-      "7   News                              https://news.example/       #AA0000  4x3   "
-      "touch,favicon\n"
-      "3   Mail                              https://mail.example/inbox  -        -     -\n"
-      "5   A very long title that will n...  https://five.example/       #00FF00  -     "
-      "favicon\n");
+  // Off a terminal nothing is cut: a script gets whole titles and URLs.
+  EXPECT_EQ(result.out,
+            "ID  TITLE                                           URL                         "
+            "COLOUR   ICON  FLAGS\n"
+            "7   News                                            https://news.example/       "
+            "#AA0000  4x3   touch,favicon\n"
+            "3   Mail                                            https://mail.example/inbox  "
+            "-        -     -\n"
+            "5   A very long title that will not fit the column  https://five.example/       "
+            "#00FF00  -     favicon\n");
   EXPECT_EQ(result.err, "");
 }
 
@@ -107,8 +118,10 @@ TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
     std::vector<std::string> arguments;
     std::string err;
   } cases[] = {
-      {{"show", "99"}, "sitedeck: show: SDS_ERROR_ID_NOT_FOUND (8)\n"},
-      {{"icon", "3", "-o", root_.dir() + "/none.png"}, "sitedeck: icon: SDS_ERROR_NO_DATA (6)\n"},
+      {{"show", "99"},
+       "sitedeck: the service answered 8 SDS_ERROR_ID_NOT_FOUND: no item has this id\n"},
+      {{"icon", "3", "-o", root_.dir() + "/none.png"},
+       "sitedeck: the service answered 6 SDS_ERROR_NO_DATA: nothing is stored for this request\n"},
   };
   for (const auto& c : cases) {
     ProcessResult result = sitedeck(c.arguments);
@@ -138,6 +151,167 @@ TEST_F(SitedeckTool, NextUpdatePrintsTheSeconds) {
   EXPECT_EQ(result.out, "7200\n");
 }
 
+struct JsonParserFree {
+  void operator()(JsonParser* parser) const { g_object_unref(parser); }
+};
+using UniqueJsonParser = std::unique_ptr<JsonParser, JsonParserFree>;
+
+// Parses the tool's output with json-glib; `*root` is its root object.
+UniqueJsonParser ParseJson(const std::string& text, JsonObject** root) {
+  UniqueJsonParser parser(json_parser_new());
+  EXPECT_TRUE(json_parser_load_from_data(parser.get(), text.c_str(), -1, nullptr)) << text;
+  JsonNode* node = json_parser_get_root(parser.get());
+  *root = node != nullptr && JSON_NODE_HOLDS_OBJECT(node) ? json_node_get_object(node) : nullptr;
+  return parser;
+}
+
+TEST_F(SitedeckTool, JsonListHasEveryLiveItemWithNullsForWhatIsNotStored) {
+  ProcessResult result = sitedeck({"--json", "list"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  JsonObject* root = nullptr;
+  UniqueJsonParser parser = ParseJson(result.out, &root);
+  ASSERT_NE(root, nullptr);
+  JsonArray* items = json_object_get_array_member(root, "items");
+  ASSERT_EQ(json_array_get_length(items), 3u);
+  JsonObject* news = json_array_get_object_element(items, 0);
+  EXPECT_EQ(json_object_get_int_member(news, "id"), 7);
+  EXPECT_STREQ(json_object_get_string_member(news, "title"), "News");
+  EXPECT_STREQ(json_object_get_string_member(news, "url"), "https://news.example/");
+  EXPECT_STREQ(json_object_get_string_member(news, "dominant_color"), "#AA0000");
+  EXPECT_STREQ(json_object_get_string_member(news, "icon_size"), "4x3");
+  EXPECT_EQ(json_object_get_int_member(news, "touch_icon_exists"), 1);
+  EXPECT_EQ(json_object_get_int_member(news, "favicon_exists"), 1);
+  JsonObject* mail = json_array_get_object_element(items, 1);
+  EXPECT_EQ(json_object_get_int_member(mail, "id"), 3);
+  EXPECT_TRUE(json_object_get_null_member(mail, "dominant_color"));
+  EXPECT_TRUE(json_object_get_null_member(mail, "icon_size"));
+  EXPECT_EQ(json_object_get_int_member(json_array_get_object_element(items, 2), "id"), 5);
+}
+
+TEST_F(SitedeckTool, JsonShowHasTheFieldsAndTheIconSize) {
+  // The option may follow the command as well.
+  ProcessResult result = sitedeck({"show", "7", "--json"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  JsonObject* root = nullptr;
+  UniqueJsonParser parser = ParseJson(result.out, &root);
+  ASSERT_NE(root, nullptr);
+  EXPECT_EQ(json_object_get_int_member(root, "id"), 7);
+  EXPECT_STREQ(json_object_get_string_member(root, "url"), "https://news.example/");
+  JsonObject* icon = json_object_get_object_member(root, "icon");
+  ASSERT_NE(icon, nullptr);
+  EXPECT_EQ(json_object_get_int_member(icon, "width"), 4);
+  EXPECT_EQ(json_object_get_int_member(icon, "height"), 3);
+  EXPECT_EQ(json_object_get_int_member(icon, "bytes"), 48);
+
+  result = sitedeck({"--json", "show", "3"});
+  UniqueJsonParser parser3 = ParseJson(result.out, &root);
+  ASSERT_NE(root, nullptr);
+  EXPECT_TRUE(json_object_get_null_member(root, "icon"));
+  EXPECT_TRUE(json_object_get_null_member(root, "dominant_color"));
+
+  // A failure is told on stderr and by the exit status, never as JSON.
+  result = sitedeck({"--json", "show", "99"});
+  EXPECT_EQ(result.exit_code, 1);
+  EXPECT_EQ(result.out, "");
+  EXPECT_EQ(result.err,
+            "sitedeck: the service answered 8 SDS_ERROR_ID_NOT_FOUND: no item has this id\n");
+}
+
+TEST_F(SitedeckTool, JsonOfTheSimpleCommands) {
+  struct Case {
+    std::vector<std::string> arguments;
+    const char* member;
+  } cases[] = {{{"--json", "hello"}, "client_id"},
+               {{"--json", "next-update"}, "seconds"},
+               {{"--json", "icon", "7", "-o", root_.dir() + "/news.png"}, "png_bytes"},
+               {{"--json", "release"}, "released"}};
+  for (const auto& c : cases) {
+    ProcessResult result = sitedeck(c.arguments);
+    ASSERT_TRUE(result.finished) << c.member;
+    EXPECT_EQ(result.exit_code, 0) << c.member << result.err;
+    JsonObject* root = nullptr;
+    UniqueJsonParser parser = ParseJson(result.out, &root);
+    ASSERT_NE(root, nullptr) << c.member;
+    EXPECT_TRUE(json_object_has_member(root, c.member)) << result.out;
+  }
+}
+
+TEST_F(SitedeckTool, NoColourEscapesUnlessStdoutIsATerminalOrColoursAreForced) {
+  for (const auto& arguments :
+       std::vector<std::vector<std::string>>{{"list"},
+                                             {"show", "7"},
+                                             {"--color=auto", "list"},
+                                             {"--json", "--color=always", "list"}}) {
+    ProcessResult result = sitedeck(arguments);
+    EXPECT_EQ(result.exit_code, 0) << arguments[0];
+    EXPECT_EQ(result.out.find('\033'), std::string::npos) << arguments[0] << result.out;
+  }
+  ProcessResult result = sitedeck({"--color=always", "list"});
+  EXPECT_NE(result.out.find("\033[48;2;170;0;0m  \033[0m #AA0000"), std::string::npos)
+      << result.out;
+  result = sitedeck({"show", "7", "--color", "always"});
+  EXPECT_NE(result.out.find("\033[1mdominant colour:\033[0m   \033[48;2;170;0;0m"),
+            std::string::npos)
+      << result.out;
+}
+
+// Runs the tool on a pseudo-terminal `columns` wide, as a person would, and
+// returns what it printed there (line ends as the terminal makes them).
+std::string RunOnTerminal(const std::vector<std::string>& argv, unsigned short columns) {
+  struct winsize size {};
+  size.ws_row = 24;
+  size.ws_col = columns;
+  int master = -1;
+  pid_t pid = forkpty(&master, nullptr, nullptr, &size);
+  if (pid < 0) return "";
+  if (pid == 0) {
+    setenv("TERM", "xterm-256color", 1);
+    unsetenv("NO_COLOR");
+    std::vector<char*> args;
+    for (const auto& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
+    args.push_back(nullptr);
+    execv(args[0], args.data());
+    _exit(127);
+  }
+  std::string out;
+  char buffer[4096];
+  for (;;) {
+    struct pollfd entry = {master, POLLIN, 0};
+    if (poll(&entry, 1, 20000) != 1) {
+      kill(pid, SIGKILL);
+      break;
+    }
+    ssize_t got = read(master, buffer, sizeof buffer);
+    if (got <= 0) break;  // EIO once the tool has ended
+    out.append(buffer, static_cast<size_t>(got));
+  }
+  close(master);
+  int status = 0;
+  (void)waitpid(pid, &status, 0);
+  return out;
+}
+
+TEST_F(SitedeckTool, OnATerminalTheTableFitsItsWidthAndHasColours) {
+  const std::string out = RunOnTerminal(
+      {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "--socket", service_.socket_path(), "list"},
+      60);
+  EXPECT_NE(out.find("\033[1mID\033[0m"), std::string::npos) << out;
+  EXPECT_NE(out.find("\033[48;2;170;0;0m  \033[0m #AA0000"), std::string::npos) << out;
+  EXPECT_NE(out.find("\r\n5   A very lo\xE2\x80\xA6  https://fi\xE2\x80\xA6  "), std::string::npos)
+      << out;
+  size_t lines = 0;
+  const std::regex escape("\033\\[[0-9;]*m");
+  for (size_t start = 0, end; (end = out.find("\r\n", start)) != std::string::npos;
+       start = end + 2) {
+    std::string line = std::regex_replace(out.substr(start, end - start), escape, "");
+    EXPECT_LE(sds_tool_display_width(line), 60u) << line;
+    ++lines;
+  }
+  EXPECT_EQ(lines, 4u) << out;
+}
+
 // A pull through the stand-in servers: the result is printed by name, and
 // "not modified" counts as success as much as a new list does.
 TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
@@ -162,14 +336,27 @@ TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
   ProcessResult result = run_process(init);
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 0) << result.err << service.output();
-  EXPECT_EQ(result.out, "pull result: SDS_ERROR_NONE (0): a new item list was stored\n");
+  EXPECT_EQ(result.out, "pull result: 0 SDS_ERROR_NONE: a new item list was stored\n");
   result = run_process({tool, "--socket", socket, "list"});
   EXPECT_EQ(result.exit_code, 0) << result.err;
   EXPECT_NE(result.out.find("\n1   Daily Herald "), std::string::npos) << result.out;
 
   result = run_process(init);
   EXPECT_EQ(result.exit_code, 0) << result.err;
-  EXPECT_EQ(result.out, "pull result: SDS_ERROR_UNKNOWN (17): the stored item list is current\n");
+  EXPECT_EQ(result.out,
+            "pull result: 17 SDS_ERROR_HTTP_NOT_MODIFIED: the stored item list is current\n");
+
+  std::vector<std::string> json_init = init;
+  json_init.insert(json_init.begin() + 1, "--json");
+  result = run_process(json_init);
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  JsonObject* pull = nullptr;
+  UniqueJsonParser parser = ParseJson(result.out, &pull);
+  ASSERT_NE(pull, nullptr);
+  EXPECT_EQ(json_object_get_int_member(pull, "status"), 17);
+  EXPECT_STREQ(json_object_get_string_member(pull, "name"), "SDS_ERROR_HTTP_NOT_MODIFIED");
+  EXPECT_STREQ(json_object_get_string_member(pull, "meaning"), "the stored item list is current");
+  EXPECT_TRUE(json_object_get_boolean_member(pull, "deck_current"));
 }
 
 }  // namespace

@@ -1,0 +1,237 @@
+// What the `sitedeck` tool tells a person when things go wrong, without the
+// real service: no socket file, a socket nobody listens on, a stand-in peer
+// that speaks the greeting and answers one request with a chosen status, and
+// bad usage. Also that every subcommand has its help, which needs no service.
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdint>
+#include <cstring>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "sitedeck-service-raii.h"
+#include "sitedeck-service-types.h"
+#include "support/run_process.h"
+#include "support/temp_root.h"
+
+namespace {
+
+// Bound on every wait of the stand-in peer for the tool.
+constexpr int kPeerWaitMs = 20000;
+
+UniqueFd BoundSocket(const std::string& path) {
+  UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  struct sockaddr_un address {};
+  address.sun_family = AF_UNIX;
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  if (!fd || bind(fd.get(), reinterpret_cast<struct sockaddr*>(&address), sizeof address) != 0) {
+    return UniqueFd();
+  }
+  return fd;
+}
+
+bool WaitReadable(int fd) {
+  struct pollfd entry = {fd, POLLIN, 0};
+  return poll(&entry, 1, kPeerWaitMs) == 1;
+}
+
+// Greets one client with `greeting` (and client id 5 after a 0), then, if
+// `status` is not negative, reads one request header and answers `status`
+// alone. A greeting of -1 closes the connection without a word.
+class StandInPeer {
+ public:
+  StandInPeer(const std::string& path, int32_t greeting, int32_t status)
+      : listener_(BoundSocket(path)) {
+    if (listener_ && listen(listener_.get(), 4) == 0) {
+      thread_ = std::thread([this, greeting, status] { serve(greeting, status); });
+    }
+  }
+  ~StandInPeer() {
+    if (thread_.joinable()) thread_.join();
+  }
+  bool ok() const { return thread_.joinable(); }
+  // The command number of the request the peer answered.
+  int32_t command() const { return header_.cmd; }
+
+ private:
+  void serve(int32_t greeting, int32_t status) {
+    if (!WaitReadable(listener_.get())) return;
+    UniqueFd client(accept(listener_.get(), nullptr, nullptr));
+    if (!client || greeting < 0) return;
+    int32_t hello[2] = {greeting, 5};
+    if (write(client.get(), hello, greeting == 0 ? sizeof hello : sizeof hello[0]) < 0) return;
+    if (status < 0 || !WaitReadable(client.get())) return;
+    if (read(client.get(), &header_, sizeof header_) != sizeof header_) return;
+    (void)write(client.get(), &status, sizeof status);
+  }
+
+  UniqueFd listener_;
+  std::thread thread_;
+  sds_command header_;
+};
+
+class SitedeckToolMessages : public ::testing::Test {
+ protected:
+  ProcessResult sitedeck(const std::vector<std::string>& arguments) {
+    std::vector<std::string> argv = {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "--socket",
+                                     socket_};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    return run_process(argv);
+  }
+
+  TempRoot root_;
+  const std::string socket_ = root_.dir() + "/peer.sock";
+};
+
+TEST_F(SitedeckToolMessages, AnUnreachableServiceIsNamedWithTheReasonAndExitsWithOne) {
+  const std::string hint = " (is the socket unit running?)\n";
+  ProcessResult result = sitedeck({"hello"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 1);
+  EXPECT_EQ(result.out, "");
+  EXPECT_EQ(result.err, "sitedeck: cannot reach the site deck service at " + socket_ +
+                            ": there is no socket file" + hint);
+
+  // A socket file left behind by a listener that is gone.
+  ASSERT_TRUE(BoundSocket(socket_));
+  result = sitedeck({"list"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 1);
+  EXPECT_EQ(result.err, "sitedeck: cannot reach the site deck service at " + socket_ +
+                            ": nobody is listening on the socket" + hint);
+}
+
+TEST_F(SitedeckToolMessages, AServiceThatHangsUpBeforeItsGreetingIsUnreachable) {
+  StandInPeer peer(socket_, -1, -1);
+  ASSERT_TRUE(peer.ok());
+  ProcessResult result = sitedeck({"hello"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 1);
+  EXPECT_EQ(result.err, "sitedeck: cannot reach the site deck service at " + socket_ +
+                            ": the service closed the connection before its greeting (is the "
+                            "socket unit running?)\n");
+}
+
+TEST_F(SitedeckToolMessages, AGreetingWithAStatusIsARefusalByName) {
+  StandInPeer peer(socket_, SDS_ERROR_SHM_FAILED, -1);
+  ASSERT_TRUE(peer.ok());
+  ProcessResult result = sitedeck({"hello"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 1);
+  EXPECT_EQ(result.out, "");
+  EXPECT_EQ(result.err,
+            "sitedeck: the service refused the connection: 2 SDS_ERROR_SHM_FAILED: the "
+            "shared-memory object for icon pixels could not be created, mapped or removed\n");
+}
+
+TEST_F(SitedeckToolMessages, EveryNonZeroStatusIsToldByNumberNameAndMeaning) {
+  const std::string answered = "sitedeck: the service answered ";
+  const std::string unused = "SDS_ERROR_UNKNOWN: a status number the service does not use\n";
+  const std::vector<std::string> expected = {
+      "",
+      "sitedeck: lost the connection to the service: 1 SDS_ERROR_IO_ERROR: a socket read or "
+      "write failed or the connection was closed\n",
+      answered +
+          "2 SDS_ERROR_SHM_FAILED: the shared-memory object for icon pixels could not "
+          "be created, mapped or removed\n",
+      answered + "3 SDS_ERROR_IO_EAGAIN: a socket operation would have blocked\n",
+      answered + "4 SDS_ERROR_IO_EINTR: a socket operation was interrupted\n",
+      answered +
+          "5 SDS_ERROR_INVALID_PARAMETER: the request had a bad argument or could not "
+          "be used\n",
+      answered + "6 SDS_ERROR_NO_DATA: nothing is stored for this request\n",
+      answered + "7 SDS_ERROR_OUT_OF_MEMORY: the service ran out of memory\n",
+      answered + "8 SDS_ERROR_ID_NOT_FOUND: no item has this id\n",
+      answered + "9 " + unused,
+      answered + "10 " + unused,
+      answered + "11 " + unused,
+      answered +
+          "12 SDS_ERROR_DISK_BUSY: the database is busy or locked, a value is too big, "
+          "or there is no connection to it\n",
+      answered + "13 " + unused,
+      answered + "14 SDS_ERROR_NO_SPACE: the database is full\n",
+      answered + "15 SDS_ERROR_DB_OPEN_FAILED: the database could not be opened\n",
+      answered + "16 SDS_ERROR_HTTP_OK: the content server answered HTTP 200\n",
+      answered +
+          "17 SDS_ERROR_HTTP_NOT_MODIFIED: the content server answered HTTP 304: the "
+          "stored item list is current\n",
+      answered +
+          "18 SDS_ERROR_SERVER_REQUEST_FAILED: a server request failed or got an "
+          "unexpected answer\n",
+      answered +
+          "19 SDS_ERROR_HTTP_MOVED_PERMANENTLY: the content server answered HTTP 301 "
+          "(moved permanently)\n",
+      answered +
+          "20 SDS_ERROR_HTTP_FOUND: the content server answered HTTP 302 (found "
+          "elsewhere)\n",
+      answered +
+          "21 SDS_ERROR_DATA_PULL_FAILED: the data pull could not run (no server list, "
+          "request URL or response header file)\n",
+  };
+  for (int32_t status = 1; status <= 21; ++status) {
+    ASSERT_TRUE(unlink(socket_.c_str()) == 0 || errno == ENOENT);
+    StandInPeer peer(socket_, 0, status);
+    ASSERT_TRUE(peer.ok()) << status;
+    ProcessResult result = sitedeck({"next-update"});
+    ASSERT_TRUE(result.finished) << status;
+    EXPECT_EQ(result.exit_code, 1) << status;
+    EXPECT_EQ(result.out, "") << status;
+    EXPECT_EQ(result.err, expected[status]) << status;
+    EXPECT_EQ(peer.command(), SDS_CMD_GET_NEXT_UPDATE_DURATION) << status;
+  }
+}
+
+const std::vector<std::string> kSubcommands = {"hello",   "list", "show",   "icon",
+                                               "release", "init", "status", "next-update"};
+
+TEST_F(SitedeckToolMessages, EverySubcommandHasHelpThatNeedsNoService) {
+  for (const auto& name : kSubcommands) {
+    for (const auto& arguments : std::vector<std::vector<std::string>>{
+             {name, "--help"}, {name, "-h"}, {"help", name}, {name, "1", "--help"}}) {
+      ProcessResult result = sitedeck(arguments);
+      ASSERT_TRUE(result.finished) << name;
+      EXPECT_EQ(result.exit_code, 0) << name << " " << arguments[1];
+      EXPECT_EQ(result.err, "") << name;
+      EXPECT_EQ(result.out.rfind("usage: sitedeck [OPTIONS] " + name, 0), 0u) << result.out;
+      EXPECT_NE(result.out.find("\nexample:\n  sitedeck "), std::string::npos) << name;
+      EXPECT_NE(result.out.find("\nexit status:\n  0  "), std::string::npos) << name;
+    }
+  }
+  ProcessResult result = sitedeck({"--help"});
+  EXPECT_EQ(result.exit_code, 0);
+  for (const auto& name : kSubcommands) {
+    EXPECT_NE(result.out.find("\n  " + name + " "), std::string::npos) << name;
+  }
+}
+
+TEST_F(SitedeckToolMessages, BadUsageIsShortWithAHintAndExitsWithTwo) {
+  const std::string hint = "Try 'sitedeck --help' for more information.\n";
+  struct Case {
+    std::vector<std::string> arguments;
+    std::string err;
+  } cases[] = {
+      {{}, "sitedeck: no command given\n" + hint},
+      {{"frobnicate"}, "sitedeck: unknown command frobnicate\n" + hint},
+      {{"--frobnicate", "list"}, "sitedeck: unknown or incomplete option --frobnicate\n" + hint},
+      {{"--color=sometimes", "list"}, "sitedeck: --color takes auto, always or never\n" + hint},
+      {{"list", "--color"}, "sitedeck: --color takes auto, always or never\n" + hint},
+      {{"help", "frobnicate"}, "sitedeck: no help for frobnicate: not a command\n" + hint},
+      {{"status", "extra"},
+       "usage: sitedeck status\nTry 'sitedeck status --help' for more information.\n"},
+  };
+  for (const auto& c : cases) {
+    ProcessResult result = sitedeck(c.arguments);
+    ASSERT_TRUE(result.finished);
+    EXPECT_EQ(result.exit_code, 2) << c.err;
+    EXPECT_EQ(result.out, "") << c.err;
+    EXPECT_EQ(result.err, c.err);
+  }
+}
+
+}  // namespace
