@@ -88,6 +88,11 @@ int sds_tool_list(SdsConnection& connection, int argc, char** /*argv*/) {
   return SDS_ERROR_NONE;
 }
 
+bool sds_tool_show_arguments(int argc, char** argv) {
+  int32_t id = 0;
+  return argc == 1 && sds_tool_parse_id(argv[0], &id);
+}
+
 int sds_tool_show(SdsConnection& connection, int argc, char** argv) {
   int32_t id = 0;
   if (argc != 1 || !sds_tool_parse_id(argv[0], &id)) return kSdsToolUsage;
@@ -152,22 +157,32 @@ int sds_tool_show(SdsConnection& connection, int argc, char** argv) {
   return SDS_ERROR_NONE;
 }
 
-int sds_tool_icon(SdsConnection& connection, int argc, char** argv) {
+// `icon ID -o FILE`, the two in either order.
+static bool __icon_arguments(int argc, char** argv, int32_t* id, const char** output) {
   const char* id_text = nullptr;
-  const char* output = nullptr;
+  *output = nullptr;
   for (int i = 0; i < argc; ++i) {
-    if (std::strcmp(argv[i], "-o") == 0 && i + 1 < argc && output == nullptr) {
-      output = argv[++i];
+    if (std::strcmp(argv[i], "-o") == 0 && i + 1 < argc && *output == nullptr) {
+      *output = argv[++i];
     } else if (id_text == nullptr) {
       id_text = argv[i];
     } else {
-      return kSdsToolUsage;
+      return false;
     }
   }
+  return id_text != nullptr && *output != nullptr && sds_tool_parse_id(id_text, id);
+}
+
+bool sds_tool_icon_arguments(int argc, char** argv) {
   int32_t id = 0;
-  if (id_text == nullptr || output == nullptr || !sds_tool_parse_id(id_text, &id)) {
-    return kSdsToolUsage;
-  }
+  const char* output = nullptr;
+  return __icon_arguments(argc, argv, &id, &output);
+}
+
+int sds_tool_icon(SdsConnection& connection, int argc, char** argv) {
+  int32_t id = 0;
+  const char* output = nullptr;
+  if (!__icon_arguments(argc, argv, &id, &output)) return kSdsToolUsage;
   sds_client_icon icon;
   int status = sds_client_get_icon(connection, id, &icon);
   if (status != SDS_ERROR_NONE) return status;

@@ -73,8 +73,12 @@ int __sds_render_icon(SdsConnection& connection, sds_render_item* entry, size_t*
 
 }  // namespace
 
+bool sds_tool_render_arguments(int argc, char** argv) {
+  return argc == 1 && argv[0][0] != '\0' && argv[0][0] != '-';
+}
+
 int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
-  if (argc != 1 || argv[0][0] == '\0' || argv[0][0] == '-') return kSdsToolUsage;
+  if (!sds_tool_render_arguments(argc, argv)) return kSdsToolUsage;
   const char* out_dir = argv[0];
 
   // Specially removed sites are not live, so the browser's list, and this

@@ -139,25 +139,40 @@ int sds_tool_release(SdsConnection& connection, int argc, char** /*argv*/) {
   return SDS_ERROR_NONE;
 }
 
-int sds_tool_init(SdsConnection& connection, int argc, char** argv) {
-  double latitude = 0, longitude = 0;
+bool sds_tool_no_arguments(int argc, char** /*argv*/) { return argc == 0; }
+
+// `init --lat LAT --lon LON [--version V]`, in any order.
+static bool __init_arguments(int argc, char** argv, double* latitude, double* longitude,
+                      const char** version) {
   bool have_latitude = false, have_longitude = false;
-  const char* version = nullptr;
+  *version = nullptr;
   // Options come in pairs: name, value.
-  if (argc % 2 != 0) return kSdsToolUsage;
+  if (argc % 2 != 0) return false;
   for (int i = 0; i < argc; i += 2) {
     const char* value = argv[i + 1];
-    if (std::strcmp(argv[i], "--lat") == 0 && sds_tool_parse_double(value, &latitude)) {
+    if (std::strcmp(argv[i], "--lat") == 0 && sds_tool_parse_double(value, latitude)) {
       have_latitude = true;
-    } else if (std::strcmp(argv[i], "--lon") == 0 && sds_tool_parse_double(value, &longitude)) {
+    } else if (std::strcmp(argv[i], "--lon") == 0 && sds_tool_parse_double(value, longitude)) {
       have_longitude = true;
     } else if (std::strcmp(argv[i], "--version") == 0) {
-      version = value;
+      *version = value;
     } else {
-      return kSdsToolUsage;
+      return false;
     }
   }
-  if (!have_latitude || !have_longitude) return kSdsToolUsage;
+  return have_latitude && have_longitude;
+}
+
+bool sds_tool_init_arguments(int argc, char** argv) {
+  double latitude = 0, longitude = 0;
+  const char* version = nullptr;
+  return __init_arguments(argc, argv, &latitude, &longitude, &version);
+}
+
+int sds_tool_init(SdsConnection& connection, int argc, char** argv) {
+  double latitude = 0, longitude = 0;
+  const char* version = nullptr;
+  if (!__init_arguments(argc, argv, &latitude, &longitude, &version)) return kSdsToolUsage;
 
   sds_tool_spinner spinner;
   bool animate = isatty(STDERR_FILENO) == 1;

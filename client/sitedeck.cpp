@@ -30,18 +30,18 @@ constexpr int kDefaultTimeoutMs = 10000;
 constexpr int kReadAttempts = 3;
 
 constexpr sds_tool_command kCommands[] = {
-    {"hello", "", "connect and print the client id the service issued", sds_tool_hello},
+    {"hello", "", "connect and print the client id the service issued", sds_tool_hello, sds_tool_no_arguments},
     {"list", "", "table of the live items: id, title, URL, colour, icon size, flags",
-     sds_tool_list},
-    {"show", "ID", "every field of item ID", sds_tool_show},
-    {"icon", "ID -o FILE", "write the icon of item ID to FILE as PNG", sds_tool_icon},
-    {"next-update", "", "seconds until the next data pull is due", sds_tool_next_update},
-    {"release", "", "remove the shared-memory object (ends the connection)", sds_tool_release},
+     sds_tool_list, sds_tool_no_arguments},
+    {"show", "ID", "every field of item ID", sds_tool_show, sds_tool_show_arguments},
+    {"icon", "ID -o FILE", "write the icon of item ID to FILE as PNG", sds_tool_icon, sds_tool_icon_arguments},
+    {"next-update", "", "seconds until the next data pull is due", sds_tool_next_update, sds_tool_no_arguments},
+    {"release", "", "remove the shared-memory object (ends the connection)", sds_tool_release, sds_tool_no_arguments},
     {"init", "--lat LAT --lon LON [--version V]",
-     "run a data pull; exit 0 when the deck is current afterwards", sds_tool_init},
+     "run a data pull; exit 0 when the deck is current afterwards", sds_tool_init, sds_tool_init_arguments},
     {"status", "", "what is stored under the data directory (no service needed)", sds_tool_status,
-     true},
-    {"render", "OUT_DIR", "write the deck as a start page to OUT_DIR/index.html", sds_tool_render},
+     sds_tool_no_arguments, true},
+    {"render", "OUT_DIR", "write the deck as a start page to OUT_DIR/index.html", sds_tool_render, sds_tool_render_arguments},
 };
 
 struct sds_tool_options {
@@ -79,6 +79,13 @@ void __sds_tool_usage(FILE* out) {
                "Run 'sitedeck help COMMAND' or 'sitedeck COMMAND --help' for one command.\n"
                "exit status: 0 success, 1 the service or the connection failed, 2 bad usage\n",
                "help [COMMAND]", "this help, or the help of COMMAND");
+}
+
+// The one-line usage of a subcommand, after arguments it could not take.
+void __sds_tool_usage_of(const sds_tool_command& command) {
+  std::fprintf(stderr, "usage: sitedeck %s%s%s\nTry 'sitedeck %s --help' for more information.\n",
+               command.name, command.arguments[0] != '\0' ? " " : "", command.arguments,
+               command.name);
 }
 
 void __sds_tool_hint(const char* what) {
@@ -256,6 +263,11 @@ int main(int argc, char** argv) {
   // The library logs every failed read and write; a person wants one line.
   dlog_set_quiet(!options.verbose);
 
+  const int command_argc = static_cast<int>(arguments.size()) - 1;
+  if (!command->arguments_ok(command_argc, arguments.data())) {
+    __sds_tool_usage_of(*command);
+    return 2;
+  }
   SdsConnection connection;
   if (!command->offline) {
     int read_timeout_ms = (options.timeout_ms + kReadAttempts - 1) / kReadAttempts;
@@ -265,11 +277,9 @@ int main(int argc, char** argv) {
       return 1;
     }
   }
-  int status = command->run(connection, static_cast<int>(arguments.size()) - 1, arguments.data());
+  int status = command->run(connection, command_argc, arguments.data());
   if (status == kSdsToolUsage) {
-    std::fprintf(stderr, "usage: sitedeck %s%s%s\nTry 'sitedeck %s --help' for more information.\n",
-                 command->name, command->arguments[0] != '\0' ? " " : "", command->arguments,
-                 command->name);
+    __sds_tool_usage_of(*command);
     return 2;
   }
   if (status == kSdsToolReported) return 1;

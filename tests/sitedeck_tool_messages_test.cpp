@@ -224,6 +224,15 @@ TEST_F(SitedeckToolMessages, BadUsageIsShortWithAHintAndExitsWithTwo) {
       {{"help", "frobnicate"}, "sitedeck: no help for frobnicate: not a command\n" + hint},
       {{"status", "extra"},
        "usage: sitedeck status\nTry 'sitedeck status --help' for more information.\n"},
+      // No service listens here: the arguments are judged before connecting,
+      // so bad usage is never reported as an unreachable service.
+      {{"show", "x"}, "usage: sitedeck show ID\nTry 'sitedeck show --help' for more information.\n"},
+      {{"icon", "3"},
+       "usage: sitedeck icon ID -o FILE\nTry 'sitedeck icon --help' for more information.\n"},
+      {{"init", "--lat", "1"},
+       "usage: sitedeck init --lat LAT --lon LON [--version V]\n"
+       "Try 'sitedeck init --help' for more information.\n"},
+      {{"list", "extra"}, "usage: sitedeck list\nTry 'sitedeck list --help' for more information.\n"},
   };
   for (const auto& c : cases) {
     ProcessResult result = sitedeck(c.arguments);
