@@ -11,6 +11,7 @@
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -89,90 +90,70 @@ class SitedeckToolMessages : public ::testing::Test {
   const std::string socket_ = root_.dir() + "/peer.sock";
 };
 
+// An absent socket, one left behind by a listener that is gone, a peer that
+// hangs up before its greeting, and a greeting that refuses with a status.
 TEST_F(SitedeckToolMessages, AnUnreachableServiceIsNamedWithTheReasonAndExitsWithOne) {
+  const std::string unreachable = "sitedeck: cannot reach the site deck service at " + socket_;
   const std::string hint = " (is the socket unit running?)\n";
-  ProcessResult result = sitedeck({"hello"});
-  ASSERT_TRUE(result.finished);
-  EXPECT_EQ(result.exit_code, 1);
-  EXPECT_EQ(result.out, "");
-  EXPECT_EQ(result.err, "sitedeck: cannot reach the site deck service at " + socket_ +
-                            ": there is no socket file" + hint);
-
-  // A socket file left behind by a listener that is gone.
-  ASSERT_TRUE(BoundSocket(socket_));
-  result = sitedeck({"list"});
-  ASSERT_TRUE(result.finished);
-  EXPECT_EQ(result.exit_code, 1);
-  EXPECT_EQ(result.err, "sitedeck: cannot reach the site deck service at " + socket_ +
-                            ": nobody is listening on the socket" + hint);
-}
-
-TEST_F(SitedeckToolMessages, AServiceThatHangsUpBeforeItsGreetingIsUnreachable) {
-  StandInPeer peer(socket_, -1, -1);
-  ASSERT_TRUE(peer.ok());
-  ProcessResult result = sitedeck({"hello"});
-  ASSERT_TRUE(result.finished);
-  EXPECT_EQ(result.exit_code, 1);
-  EXPECT_EQ(result.err, "sitedeck: cannot reach the site deck service at " + socket_ +
-                            ": the service closed the connection before its greeting (is the "
-                            "socket unit running?)\n");
-}
-
-TEST_F(SitedeckToolMessages, AGreetingWithAStatusIsARefusalByName) {
-  StandInPeer peer(socket_, SDS_ERROR_SHM_FAILED, -1);
-  ASSERT_TRUE(peer.ok());
-  ProcessResult result = sitedeck({"hello"});
-  ASSERT_TRUE(result.finished);
-  EXPECT_EQ(result.exit_code, 1);
-  EXPECT_EQ(result.out, "");
-  EXPECT_EQ(result.err,
-            "sitedeck: the service refused the connection: 2 SDS_ERROR_SHM_FAILED: the "
-            "shared-memory object for icon pixels could not be created, mapped or removed\n");
+  enum Peer { kNone, kGone, kHangsUp, kRefuses };
+  struct Case {
+    Peer peer;
+    std::string err;
+  } cases[] = {
+      {kNone, unreachable + ": there is no socket file" + hint},
+      {kGone, unreachable + ": nobody is listening on the socket" + hint},
+      {kHangsUp, unreachable + ": the service closed the connection before its greeting" + hint},
+      {kRefuses,
+       "sitedeck: the service refused the connection: 2 SDS_ERROR_SHM_FAILED: the "
+       "shared-memory object for icon pixels could not be created, mapped or removed\n"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.peer);
+    ASSERT_TRUE(unlink(socket_.c_str()) == 0 || errno == ENOENT);
+    UniqueFd gone = c.peer == kGone ? BoundSocket(socket_) : UniqueFd();
+    ASSERT_EQ(static_cast<bool>(gone), c.peer == kGone);
+    std::optional<StandInPeer> peer;
+    if (c.peer >= kHangsUp) {
+      peer.emplace(socket_, c.peer == kHangsUp ? -1 : SDS_ERROR_SHM_FAILED, -1);
+      ASSERT_TRUE(peer->ok());
+    }
+    ProcessResult result = sitedeck({"hello"});
+    ASSERT_TRUE(result.finished);
+    EXPECT_EQ(result.exit_code, 1);
+    EXPECT_EQ(result.out, "");
+    EXPECT_EQ(result.err, c.err);
+  }
 }
 
 TEST_F(SitedeckToolMessages, EveryNonZeroStatusIsToldByNumberNameAndMeaning) {
-  const std::string answered = "sitedeck: the service answered ";
-  const std::string unused = "SDS_ERROR_UNKNOWN: a status number the service does not use\n";
-  const std::vector<std::string> expected = {
-      "",
-      "sitedeck: lost the connection to the service: 1 SDS_ERROR_IO_ERROR: a socket read or "
-      "write failed or the connection was closed\n",
-      answered +
-          "2 SDS_ERROR_SHM_FAILED: the shared-memory object for icon pixels could not "
-          "be created, mapped or removed\n",
-      answered + "3 SDS_ERROR_IO_EAGAIN: a socket operation would have blocked\n",
-      answered + "4 SDS_ERROR_IO_EINTR: a socket operation was interrupted\n",
-      answered +
-          "5 SDS_ERROR_INVALID_PARAMETER: the request had a bad argument or could not "
-          "be used\n",
-      answered + "6 SDS_ERROR_NO_DATA: nothing is stored for this request\n",
-      answered + "7 SDS_ERROR_OUT_OF_MEMORY: the service ran out of memory\n",
-      answered + "8 SDS_ERROR_ID_NOT_FOUND: no item has this id\n",
-      answered + "9 " + unused,
-      answered + "10 " + unused,
-      answered + "11 " + unused,
-      answered +
-          "12 SDS_ERROR_DISK_BUSY: the database is busy or locked, a value is too big, "
-          "or there is no connection to it\n",
-      answered + "13 " + unused,
-      answered + "14 SDS_ERROR_NO_SPACE: the database is full\n",
-      answered + "15 SDS_ERROR_DB_OPEN_FAILED: the database could not be opened\n",
-      answered + "16 SDS_ERROR_HTTP_OK: the content server answered HTTP 200\n",
-      answered +
-          "17 SDS_ERROR_HTTP_NOT_MODIFIED: the content server answered HTTP 304: the "
-          "stored item list is current\n",
-      answered +
-          "18 SDS_ERROR_SERVER_REQUEST_FAILED: a server request failed or got an "
-          "unexpected answer\n",
-      answered +
-          "19 SDS_ERROR_HTTP_MOVED_PERMANENTLY: the content server answered HTTP 301 "
-          "(moved permanently)\n",
-      answered +
-          "20 SDS_ERROR_HTTP_FOUND: the content server answered HTTP 302 (found "
-          "elsewhere)\n",
-      answered +
-          "21 SDS_ERROR_DATA_PULL_FAILED: the data pull could not run (no server list, "
-          "request URL or response header file)\n",
+  // After the number; nullptr: a number the service does not use.
+  const char* told[] = {
+      nullptr,
+      "SDS_ERROR_IO_ERROR: a socket read or write failed or the connection was closed",
+      "SDS_ERROR_SHM_FAILED: the shared-memory object for icon pixels could not be created, "
+      "mapped or removed",
+      "SDS_ERROR_IO_EAGAIN: a socket operation would have blocked",
+      "SDS_ERROR_IO_EINTR: a socket operation was interrupted",
+      "SDS_ERROR_INVALID_PARAMETER: the request had a bad argument or could not be used",
+      "SDS_ERROR_NO_DATA: nothing is stored for this request",
+      "SDS_ERROR_OUT_OF_MEMORY: the service ran out of memory",
+      "SDS_ERROR_ID_NOT_FOUND: no item has this id",
+      nullptr,
+      nullptr,
+      nullptr,
+      "SDS_ERROR_DISK_BUSY: the database is busy or locked, a value is too big, or there is no "
+      "connection to it",
+      nullptr,
+      "SDS_ERROR_NO_SPACE: the database is full",
+      "SDS_ERROR_DB_OPEN_FAILED: the database could not be opened",
+      "SDS_ERROR_HTTP_OK: the content server answered HTTP 200",
+      "SDS_ERROR_HTTP_NOT_MODIFIED: the content server answered HTTP 304: the stored item list is "
+      "current",
+      "SDS_ERROR_SERVER_REQUEST_FAILED: a server request failed or got an unexpected answer",
+      "SDS_ERROR_HTTP_MOVED_PERMANENTLY: the content server answered HTTP 301 (moved permanently)",
+      "SDS_ERROR_HTTP_FOUND: the content server answered HTTP 302 (found elsewhere)",
+      "SDS_ERROR_DATA_PULL_FAILED: the data pull could not run (no server list, request URL or "
+      "response header file)",
   };
   for (int32_t status = 1; status <= 21; ++status) {
     ASSERT_TRUE(unlink(socket_.c_str()) == 0 || errno == ENOENT);
@@ -182,7 +163,15 @@ TEST_F(SitedeckToolMessages, EveryNonZeroStatusIsToldByNumberNameAndMeaning) {
     ASSERT_TRUE(result.finished) << status;
     EXPECT_EQ(result.exit_code, 1) << status;
     EXPECT_EQ(result.out, "") << status;
-    EXPECT_EQ(result.err, expected[status]) << status;
+    EXPECT_EQ(result.err,
+              (status == 1 ? "sitedeck: lost the connection to the service: "
+                           : "sitedeck: the service answered ") +
+                  std::to_string(status) + " " +
+                  (told[status] != nullptr
+                       ? told[status]
+                       : "SDS_ERROR_UNKNOWN: a status number the service does not use") +
+                  "\n")
+        << status;
     EXPECT_EQ(peer.command(), SDS_CMD_GET_NEXT_UPDATE_DURATION) << status;
   }
 }
@@ -226,13 +215,17 @@ TEST_F(SitedeckToolMessages, BadUsageIsShortWithAHintAndExitsWithTwo) {
        "usage: sitedeck status\nTry 'sitedeck status --help' for more information.\n"},
       // No service listens here: the arguments are judged before connecting,
       // so bad usage is never reported as an unreachable service.
-      {{"show", "x"}, "usage: sitedeck show ID\nTry 'sitedeck show --help' for more information.\n"},
+      {{"show", "x"},
+       "usage: sitedeck show ID\nTry 'sitedeck show --help' for more information.\n"},
       {{"icon", "3"},
        "usage: sitedeck icon ID -o FILE\nTry 'sitedeck icon --help' for more information.\n"},
       {{"init", "--lat", "1"},
        "usage: sitedeck init --lat LAT --lon LON [--version V]\n"
        "Try 'sitedeck init --help' for more information.\n"},
-      {{"list", "extra"}, "usage: sitedeck list\nTry 'sitedeck list --help' for more information.\n"},
+      {{"list", "extra"},
+       "usage: sitedeck list\nTry 'sitedeck list --help' for more information.\n"},
+      {{"show", "-1"},
+       "usage: sitedeck show ID\nTry 'sitedeck show --help' for more information.\n"},
   };
   for (const auto& c : cases) {
     ProcessResult result = sitedeck(c.arguments);
