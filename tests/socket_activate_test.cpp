@@ -7,12 +7,10 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
-#include <chrono>
 #include <csignal>
 #include <cstring>
 #include <filesystem>
@@ -30,86 +28,67 @@ namespace {
 
 constexpr int kBoundMs = 20000;
 
-int left_ms(std::chrono::steady_clock::time_point deadline) {
-  auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-      deadline - std::chrono::steady_clock::now());
-  return left.count() > 0 ? static_cast<int>(left.count()) : 0;
-}
-
 // One program run with its standard error read through a pipe, so that a
 // line it prints can be waited for; killed and reaped when still running.
 class Child {
  public:
-  explicit Child(const std::vector<std::string>& argv) {
+  explicit Child(std::vector<std::string> argv) {
     int err[2];
     if (pipe2(err, O_CLOEXEC) != 0) return;
-    std::vector<std::string> args = argv;
-    std::vector<char*> argvp;
-    for (auto& a : args) argvp.push_back(a.data());
-    argvp.push_back(nullptr);
+    std::vector<char*> args;
+    for (auto& a : argv) args.push_back(a.data());
+    args.push_back(nullptr);
     pid_ = fork();
     if (pid_ == 0) {
       (void)dup2(err[1], STDERR_FILENO);
-      execv(argvp[0], argvp.data());
+      execv(args[0], args.data());
       _exit(127);
     }
     (void)close(err[1]);
     err_ = err[0];
-    if (pid_ > 0) pidfd_ = static_cast<int>(syscall(SYS_pidfd_open, pid_, 0));
   }
   ~Child() {
-    if (pid_ > 0) {
-      (void)kill(pid_, SIGKILL);
-      (void)waitpid(pid_, nullptr, 0);
-    }
-    if (pidfd_ >= 0) (void)close(pidfd_);
+    if (pid_ > 0) (void)kill(pid_, SIGKILL);
+    if (pid_ > 0) (void)waitpid(pid_, nullptr, 0);
     if (err_ >= 0) (void)close(err_);
   }
-  Child(const Child&) = delete;
-  Child& operator=(const Child&) = delete;
 
-  // Reads standard error until it holds `text`, the program's end or the bound.
-  bool wait_for_output(const std::string& text, int timeout_ms) {
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeout_ms);
-    while (err_ >= 0 && output_.find(text) == std::string::npos) {
-      struct pollfd entry = {err_, POLLIN, 0};
-      if (poll(&entry, 1, left_ms(deadline)) != 1) return false;
-      if (!read_some()) return false;
+  // Reads standard error until it holds `text` or ends; each read is bounded.
+  bool wait_for_output(const std::string& text) {
+    while (output_.find(text) == std::string::npos && read_some()) {
     }
     return output_.find(text) != std::string::npos;
   }
 
-  // Waits for the program to end and reaps it; the exit status or -1 when it
-  // did not exit by itself or ran over the bound.
-  int wait_exit(int timeout_ms) {
-    struct pollfd entry = {pidfd_, POLLIN, 0};
-    if (pid_ <= 0 || pidfd_ < 0 || poll(&entry, 1, timeout_ms) != 1) return -1;
-    int status = 0;
-    if (waitpid(pid_, &status, 0) != pid_) return -1;
-    pid_ = -1;
-    // What it printed last is all in the pipe now.
-    while (err_ >= 0 && read_some()) {
+  // Reads standard error to its end (the program's), then reaps the program:
+  // its exit status, or -1 when it did not exit by itself or the end was not
+  // reached within the bound.
+  int wait_exit() {
+    while (read_some()) {
     }
+    struct pollfd entry = {err_, POLLIN, 0};
+    int status = 0;
+    if (pid_ <= 0 || poll(&entry, 1, 0) != 1 || waitpid(pid_, &status, 0) != pid_) return -1;
+    pid_ = -1;
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   }
 
-  bool started() const { return pid_ > 0 && pidfd_ >= 0 && err_ >= 0; }
-  pid_t pid() const { return pid_; }
+  bool started() const { return pid_ > 0 && err_ >= 0; }
   const std::string& output() const { return output_; }
 
  private:
-  // False at the end of the pipe or on an error.
+  // False at the end of the pipe, on an error or when nothing came within the bound.
   bool read_some() {
     char buffer[4096];
+    struct pollfd entry = {err_, POLLIN, 0};
+    if (poll(&entry, 1, kBoundMs) != 1) return false;
     ssize_t got = read(err_, buffer, sizeof buffer);
-    if (got < 0 && errno == EINTR) return true;
-    if (got <= 0) return false;
+    if (got <= 0) return got < 0 && errno == EINTR;
     output_.append(buffer, static_cast<size_t>(got));
     return true;
   }
 
   pid_t pid_ = -1;
-  int pidfd_ = -1;
   int err_ = -1;
   std::string output_;
 };
@@ -141,7 +120,7 @@ TEST(SocketActivate, ServiceUnderSystemdActivationServesOneConnectionAndEnds) {
   argv.push_back(std::string(SITEDECK_BIN_DIR) + "/browser-sitedeck-service");
   Child child(argv);
   ASSERT_TRUE(child.started());
-  ASSERT_TRUE(child.wait_for_output("Listening on " + socket_path, kBoundMs)) << child.output();
+  ASSERT_TRUE(child.wait_for_output("Listening on " + socket_path)) << child.output();
 
   SdsConnection connection;
   ASSERT_EQ(sds_client_connect(socket_path, &connection, kBoundMs), SDS_ERROR_NONE)
@@ -161,7 +140,7 @@ TEST(SocketActivate, ServiceUnderSystemdActivationServesOneConnectionAndEnds) {
   // Releasing the icon object ends the connection. The tool execs the
   // service in its own process: the process that then ends is the one started.
   EXPECT_EQ(sds_client_release_shm(connection), SDS_ERROR_NONE);
-  EXPECT_EQ(child.wait_exit(kBoundMs), 0) << child.output();
+  EXPECT_EQ(child.wait_exit(), 0) << child.output();
   EXPECT_NE(child.output().find("listen systemd socket:3"), std::string::npos) << child.output();
 }
 
