@@ -54,21 +54,37 @@ struct JsonParserFree {
 };
 using UniqueJsonParser = std::unique_ptr<JsonParser, JsonParserFree>;
 
+// Whether the tool printed the JSON document `expected` (members in any
+// order). The database's age grows with the clock: it must be above zero
+// and is then taken as 1.
+::testing::AssertionResult IsJson(const std::string& text, const std::string& expected) {
+  UniqueJsonParser got(json_parser_new()), want(json_parser_new());
+  if (!json_parser_load_from_data(got.get(), text.c_str(), -1, nullptr) ||
+      !json_parser_load_from_data(want.get(), expected.c_str(), -1, nullptr) ||
+      !JSON_NODE_HOLDS_OBJECT(json_parser_get_root(got.get()))) {
+    return ::testing::AssertionFailure() << "not JSON: " << text;
+  }
+  JsonNode* database =
+      json_object_get_member(json_node_get_object(json_parser_get_root(got.get())), "database");
+  if (database != nullptr && JSON_NODE_HOLDS_OBJECT(database)) {
+    JsonObject* object = json_node_get_object(database);
+    if (json_object_get_int_member(object, "age_seconds") <= 0) {
+      return ::testing::AssertionFailure() << text;
+    }
+    json_object_set_int_member(object, "age_seconds", 1);
+  }
+  if (!json_node_equal(json_parser_get_root(got.get()), json_parser_get_root(want.get()))) {
+    return ::testing::AssertionFailure() << "printed " << text;
+  }
+  return ::testing::AssertionSuccess();
+}
+
 class SitedeckStatus : public ::testing::Test {
  protected:
-  void SetUp() override {
-    const char* tz = std::getenv("TZ");
-    had_tz_ = tz != nullptr;
-    if (had_tz_) old_tz_ = tz;
-    // The time stamp is printed in local time; the tool inherits this.
-    setenv("TZ", "UTC", 1);
-  }
+  // The time stamp is printed in local time; the tool inherits this.
+  void SetUp() override { setenv("TZ", "UTC", 1); }
   void TearDown() override {
-    if (had_tz_) {
-      setenv("TZ", old_tz_.c_str(), 1);
-    } else {
-      unsetenv("TZ");
-    }
+    (void)(old_tz_ != nullptr ? setenv("TZ", old_tz_->c_str(), 1) : unsetenv("TZ"));
   }
 
   void Seed() {
@@ -99,18 +115,10 @@ class SitedeckStatus : public ::testing::Test {
     return run_process(argv);
   }
 
-  // The JSON document the tool printed, parsed; its root object in `*root`.
-  UniqueJsonParser Parse(const std::string& text, JsonObject** root) {
-    UniqueJsonParser parser(json_parser_new());
-    EXPECT_TRUE(json_parser_load_from_data(parser.get(), text.c_str(), -1, nullptr)) << text;
-    JsonNode* node = json_parser_get_root(parser.get());
-    *root = node != nullptr && JSON_NODE_HOLDS_OBJECT(node) ? json_node_get_object(node) : nullptr;
-    return parser;
-  }
-
+  std::unique_ptr<std::string> old_tz_ =
+      std::getenv("TZ") != nullptr ? std::make_unique<std::string>(std::getenv("TZ")) : nullptr;
   TempRoot root_;
-  bool had_tz_ = false;
-  std::string old_tz_;
+  const std::string data_ = root_.path(SDS_DATA_DIR);
 };
 
 TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
@@ -120,8 +128,7 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 0) << result.err;
   EXPECT_EQ(result.err, "");
-  const std::string data = root_.path(SDS_DATA_DIR);
-  const std::string head = "data directory: " + data + "\n" +
+  const std::string head = "data directory: " + data_ + "\n" +
                            "servers:        2 configured\n"
                            "  ID  BASE URL                      WAIT      RETRIES  FALLBACK\n"
                            "  1   http://127.0.0.1:8080/        500 ms    3        no\n"
@@ -133,102 +140,77 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
                            "database:       modified ";
   ASSERT_EQ(result.out.substr(0, head.size()), head);
   // The age grows with the clock; its form and the time stamp do not.
-  std::string database_line = result.out.substr(head.size());
-  EXPECT_TRUE(std::regex_match(database_line,
+  EXPECT_TRUE(std::regex_match(result.out.substr(head.size()),
                                std::regex("\\d+ d \\d+ h ago \\(2020-01-01 00:00:00 UTC\\)\n")))
-      << database_line;
+      << result.out;
 
   result = Status({"--json"});
   EXPECT_EQ(result.exit_code, 0) << result.err;
   EXPECT_EQ(Snapshot(root_.dir()), before);
-
-  JsonObject* root = nullptr;
-  UniqueJsonParser parser = Parse(result.out, &root);
-  ASSERT_NE(root, nullptr);
-  EXPECT_STREQ(json_object_get_string_member(root, "data_directory"), data.c_str());
-  JsonArray* servers = json_object_get_array_member(root, "servers");
-  ASSERT_EQ(json_array_get_length(servers), 2u);
-  JsonObject* backup = json_array_get_object_element(servers, 1);
-  EXPECT_EQ(json_object_get_int_member(backup, "id"), 2);
-  EXPECT_STREQ(json_object_get_string_member(backup, "base_url"), "https://backup.example/deck/");
-  EXPECT_EQ(json_object_get_int_member(backup, "wait_time_ms"), 60000);
-  EXPECT_EQ(json_object_get_int_member(backup, "retry_count"), 1);
-  EXPECT_TRUE(json_object_get_boolean_member(backup, "fall_back"));
-  EXPECT_STREQ(json_object_get_string_member(root, "etag"), "\"v1-abc\"");
-  JsonObject* next = json_object_get_object_member(root, "next_update");
-  EXPECT_STREQ(json_object_get_string_member(next, "stored"), "3600");
-  EXPECT_EQ(json_object_get_int_member(next, "seconds"), 3600);
-  JsonObject* location = json_object_get_object_member(root, "location");
-  EXPECT_STREQ(json_object_get_string_member(location, "position"), "37.500000,127.000000");
-  EXPECT_STREQ(json_object_get_string_member(location, "city"), "Jongno-gu");
-  EXPECT_STREQ(json_object_get_string_member(location, "province"), "Seoul");
-  JsonObject* database = json_object_get_object_member(root, "database");
-  EXPECT_STREQ(json_object_get_string_member(database, "path"), root_.path(SDS_DB_PATH).c_str());
-  EXPECT_EQ(json_object_get_int_member(database, "live_items"), 2);
-  EXPECT_EQ(json_object_get_int_member(database, "hidden_items"), 1);
-  EXPECT_EQ(json_object_get_int_member(database, "modified"), kDatabaseTime);
+  EXPECT_TRUE(IsJson(result.out, R"({"data_directory": ")" + data_ + R"(",
+      "servers": [
+        {"id": 1, "base_url": "http://127.0.0.1:8080/", "wait_time_ms": 500, "retry_count": 3,
+         "fall_back": false},
+        {"id": 2, "base_url": "https://backup.example/deck/", "wait_time_ms": 60000,
+         "retry_count": 1, "fall_back": true}],
+      "etag": "\"v1-abc\"",
+      "next_update": {"stored": "3600", "seconds": 3600},
+      "location": {"position": "37.500000,127.000000", "city": "Jongno-gu", "province": "Seoul"},
+      "database": {"path": ")" + root_.path(SDS_DB_PATH) +
+                                     R"(", "live_items": 2,
+                   "hidden_items": 1, "modified": 1577836800, "age_seconds": 1}})"));
 }
 
-TEST_F(SitedeckStatus, EmptyRootAnswersNoneAndCreatesNoDatabase) {
-  ProcessResult result = Status();
-  ASSERT_TRUE(result.finished);
-  EXPECT_EQ(result.exit_code, 0) << result.err;
-  const std::string data = root_.path(SDS_DATA_DIR);
-  EXPECT_EQ(result.out, "data directory: " + data + "\n" +
-                            "servers:        none (no usable server list at " +
-                            root_.path(SDS_SERVER_DATA_XML) + ")\n" +
-                            "stored ETag:    none\n"
-                            "next update:    none (86400 s is used)\n"
-                            "last position:  none\n"
-                            "items:          none\n"
-                            "database:       no database at " +
-                            root_.path(SDS_DB_PATH) + "\n");
-  EXPECT_FALSE(file_exists(root_.path(SDS_DB_PATH)));
-
-  result = Status({"--json"});
-  EXPECT_EQ(result.exit_code, 0) << result.err;
-  JsonObject* root = nullptr;
-  UniqueJsonParser parser = Parse(result.out, &root);
-  ASSERT_NE(root, nullptr);
-  for (const char* member : {"servers", "etag", "location", "database"}) {
-    EXPECT_TRUE(json_object_get_null_member(root, member)) << member;
+// Missing or broken files are told, not failures; nothing is written and no
+// database is created.
+TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
+  struct Case {
+    const char* name;
+    bool broken;
+    std::string next_update, database, stored;  // `stored`: the next update's, as JSON
+  } cases[] = {
+      {"empty root", false, "none", "", "null"},
+      {"broken files", true, "\"0\" is not above 0", ": file is not a database", "\"0\""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    if (c.broken) {
+      ASSERT_TRUE(write_file(root_.path(SDS_SERVER_DATA_XML), "<values><Server>"));
+      ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "0\n"));
+      ASSERT_TRUE(write_file(root_.path(SDS_LOCATION_INFO_PATH), "not xml"));
+      ASSERT_TRUE(write_file(root_.path(SDS_DB_PATH), "this is not an SQLite database file"));
+    }
+    const auto before = Snapshot(root_.dir());
+    ProcessResult result = Status();
+    ASSERT_TRUE(result.finished);
+    EXPECT_EQ(result.exit_code, 0) << result.err;
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(result.out, "data directory: " + data_ + "\n" +
+                              "servers:        none (no usable server list at " +
+                              root_.path(SDS_SERVER_DATA_XML) + ")\n" + "stored ETag:    none\n" +
+                              "next update:    " + c.next_update + " (86400 s is used)\n" +
+                              "last position:  none\nitems:          none\n" +
+                              "database:       no database at " + root_.path(SDS_DB_PATH) +
+                              c.database + "\n");
+    result = Status({"--json"});
+    EXPECT_EQ(result.exit_code, 0) << result.err;
+    EXPECT_TRUE(IsJson(result.out, R"({"data_directory": ")" + data_ +
+                                       R"(", "servers": null, "etag": null, "location": null,
+                                       "database": null, "next_update": {"stored": )" +
+                                       c.stored + R"(, "seconds": 86400}})"));
+    EXPECT_EQ(Snapshot(root_.dir()), before);
+    EXPECT_EQ(file_exists(root_.path(SDS_DB_PATH)), c.broken);
   }
-  JsonObject* next = json_object_get_object_member(root, "next_update");
-  EXPECT_TRUE(json_object_get_null_member(next, "stored"));
-  EXPECT_EQ(json_object_get_int_member(next, "seconds"), 86400);
-  EXPECT_FALSE(file_exists(root_.path(SDS_DB_PATH)));
-}
-
-TEST_F(SitedeckStatus, BrokenFilesAreExplainedNotFailures) {
-  ASSERT_TRUE(write_file(root_.path(SDS_SERVER_DATA_XML), "<values><Server>"));
-  ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "0\n"));
-  ASSERT_TRUE(write_file(root_.path(SDS_LOCATION_INFO_PATH), "not xml"));
-  ASSERT_TRUE(write_file(root_.path(SDS_DB_PATH), "this is not an SQLite database file"));
-  const auto before = Snapshot(root_.dir());
-  ProcessResult result = Status();
-  ASSERT_TRUE(result.finished);
-  EXPECT_EQ(result.exit_code, 0) << result.err;
-  EXPECT_EQ(result.err, "");
-  EXPECT_EQ(result.out, "data directory: " + root_.path(SDS_DATA_DIR) + "\n" +
-                            "servers:        none (no usable server list at " +
-                            root_.path(SDS_SERVER_DATA_XML) + ")\n" +
-                            "stored ETag:    none\n"
-                            "next update:    \"0\" is not above 0 (86400 s is used)\n"
-                            "last position:  none\n"
-                            "items:          none\n"
-                            "database:       no database at " +
-                            root_.path(SDS_DB_PATH) + ": file is not a database\n");
-  EXPECT_EQ(Snapshot(root_.dir()), before);
 }
 
 TEST_F(SitedeckStatus, MissingDataDirectoryIsTheOneFailure) {
-  std::filesystem::remove_all(root_.path(SDS_DATA_DIR));
+  std::filesystem::remove_all(data_);
   ProcessResult result = Status();
   ASSERT_TRUE(result.finished);
   EXPECT_EQ(result.exit_code, 1);
   EXPECT_EQ(result.out, "");
-  EXPECT_EQ(result.err, "sitedeck: status: no data directory at " + root_.path(SDS_DATA_DIR) +
-                            " (is the service installed?)\n");
+  EXPECT_EQ(result.err,
+            "sitedeck: status: no data directory at " + data_ + " (is the service installed?)\n");
 }
 
 }  // namespace
