@@ -26,10 +26,8 @@ constexpr char kChromium[] = "/usr/bin/chromium";
 // A browser start is seconds; this bound only stops a hung one.
 constexpr int kBrowserTimeoutMs = 120000;
 
-// Stored pixels of an icon as the service keeps them after a download: a
-// real PNG of the given colour type, decoded by the service's own code.
-std::vector<uint8_t> stored_icon(const PngImage& image) {
-  std::string png = png_encode_image(image);
+// A PNG decoded by the service's own code: B,G,R,A bytes, empty on failure.
+std::vector<uint8_t> decoded(const std::string& png) {
   unsigned char* raw = nullptr;
   int w = 0, h = 0, size = 0;
   if (convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()), png.size(), &raw,
@@ -48,14 +46,11 @@ SeedItem tile(int id, int order, const char* url, std::optional<std::string> tit
   return item;
 }
 
+// Stored pixels as the service keeps them after downloading a real PNG.
 void with_icon(SeedItem& item, const PngImage& image) {
-  item.icon_data = stored_icon(image);
+  item.icon_data = decoded(png_encode_image(image));
   item.icon_size = std::to_string(image.width) + "x" + std::to_string(image.height);
   item.touch_icon_exists = 1;
-}
-
-void with_icon(SeedItem& item, int width, int height, int color_type, int bit_depth) {
-  with_icon(item, png_pattern(width, height, color_type, bit_depth));
 }
 
 // An opaque icon of one colour, which stays that exact colour when the
@@ -102,14 +97,8 @@ std::vector<DomTile> dom_tiles(const std::string& dom) {
 // How many pixels of a screenshot have exactly each colour (0xRRGGBB).
 std::map<uint32_t, int> colour_counts(const std::string& png) {
   std::map<uint32_t, int> counts;
-  unsigned char* raw = nullptr;
-  int width = 0, height = 0, size = 0;
-  if (convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()), png.size(), &raw,
-                              &width, &height, &size) != 0) {
-    return counts;
-  }
-  UniqueMalloc<unsigned char> owner(raw);
-  for (int i = 0; i + 3 < size; i += 4) {
+  std::vector<uint8_t> raw = decoded(png);
+  for (size_t i = 0; i + 3 < raw.size(); i += 4) {
     ++counts[uint32_t{raw[i + 2]} << 16 | uint32_t{raw[i + 1]} << 8 | raw[i]];
   }
   return counts;
@@ -154,15 +143,15 @@ TEST_F(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
   SeedItem news = tile(20, 1, "https://news.example/", "News", "#E53935");
   with_icon(news, solid_icon(48, 0xff, 0x00, 0x00));
   SeedItem marked = tile(3, 2, "https://marked.example/", "<b>&\"'", "#1E88E5");
-  with_icon(marked, 16, 16, 0, 8);
+  with_icon(marked, png_pattern(16, 16, 0, 8));
   SeedItem mail = tile(8, 3, "https://mail.example/inbox", "Mail", "#3c3");
   SeedItem gone = tile(5, 4, "https://gone.example/", "Gone", "#FFEB3B");
   gone.is_dirty = -1;
-  with_icon(gone, 32, 32, 6, 8);
+  with_icon(gone, png_pattern(32, 32, 6, 8));
   SeedItem maps = tile(11, 5, "https://maps.example:8443/x", std::nullopt, "tomato");
-  with_icon(maps, 100, 60, 3, 8);
+  with_icon(maps, png_pattern(100, 60, 3, 8));
   SeedItem script = tile(12, 6, "javascript:alert(1)", "Script", "#8E24AA");
-  with_icon(script, 24, 36, 2, 16);
+  with_icon(script, png_pattern(24, 36, 2, 16));
   ASSERT_TRUE(seed_deck({news, marked, mail, gone, maps, script}));
   ASSERT_TRUE(service_.start_activated(/*once=*/false));
 
@@ -223,18 +212,6 @@ TEST_F(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
   EXPECT_EQ(counts[0x0000ff], 0);
 }
 
-TEST_F(RenderTool, EmptyDeckGivesAPageWithNoTiles) {
-  ASSERT_TRUE(seed_deck({}));
-  ASSERT_TRUE(service_.start_activated(/*once=*/false));
-  ProcessResult result = sitedeck({"render", root_.dir() + "/empty"});
-  ASSERT_TRUE(result.finished);
-  EXPECT_EQ(result.exit_code, 0) << result.err;
-  EXPECT_EQ(result.out, root_.dir() + "/empty/index.html\n");
-  std::string page = read_file(root_.dir() + "/empty/index.html");
-  EXPECT_NE(page.find("<span class=\"count\">0 sites</span>"), std::string::npos) << page;
-  EXPECT_EQ(page.find("<li"), std::string::npos);
-}
-
 TEST_F(RenderTool, OversizedDeckIsCutToTheFirstThousandTiles) {
   std::vector<SeedItem> items;
   for (int i = 1; i <= 1001; ++i) {
@@ -252,31 +229,37 @@ TEST_F(RenderTool, OversizedDeckIsCutToTheFirstThousandTiles) {
   EXPECT_EQ(page.find("data-id=\"1001\""), std::string::npos);
 }
 
-TEST_F(RenderTool, BadUsageAndUnwritableDirectoryAreReported) {
-  const std::string kRenderUsage =
+// An empty deck gives a page with no tiles; bad usage and a directory that
+// cannot be made are told and write nothing.
+TEST_F(RenderTool, EmptyDeckBadUsageAndAnUnwritableDirectory) {
+  const std::string usage =
       "usage: sitedeck render OUT_DIR\nTry 'sitedeck render --help' for more information.\n";
-  ASSERT_TRUE(seed_deck({seed_item(1, "https://a.example/", "A", 1)}));
+  ASSERT_TRUE(seed_deck({}));
   ASSERT_TRUE(service_.start_activated(/*once=*/false));
-  const std::string file = root_.dir() + "/plain-file";
+  const std::string file = root_.dir() + "/plain-file", empty = root_.dir() + "/empty";
   ASSERT_TRUE(write_file(file, "x"));
   struct Case {
     std::vector<std::string> arguments;
     int exit_code;
-    std::string err;
+    std::string out, err;
   } cases[] = {
-      {{"render"}, 2, kRenderUsage},
-      {{"render", "a", "b"}, 2, kRenderUsage},
-      {{"render", "--bogus"}, 2, kRenderUsage},
-      {{"render", file}, 1, "sitedeck: render: cannot create " + file + ": Not a directory\n"},
+      {{"render", empty}, 0, empty + "/index.html\n", ""},
+      {{"render"}, 2, "", usage},
+      {{"render", "a", "b"}, 2, "", usage},
+      {{"render", "--bogus"}, 2, "", usage},
+      {{"render", file}, 1, "", "sitedeck: render: cannot create " + file + ": Not a directory\n"},
   };
   for (const auto& c : cases) {
     ProcessResult result = sitedeck(c.arguments);
     ASSERT_TRUE(result.finished) << c.err;
     EXPECT_EQ(result.exit_code, c.exit_code) << c.err;
     EXPECT_EQ(result.err, c.err);
-    EXPECT_EQ(result.out, "");
+    EXPECT_EQ(result.out, c.out);
   }
   EXPECT_EQ(read_file(file), "x");
+  std::string page = read_file(empty + "/index.html");
+  EXPECT_NE(page.find("<span class=\"count\">0 sites</span>"), std::string::npos) << page;
+  EXPECT_EQ(page.find("<li"), std::string::npos);
 }
 
 }  // namespace
