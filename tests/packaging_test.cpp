@@ -59,73 +59,57 @@ void install_or_fail(const std::string& stage, const std::string& prefix) {
     GTEST_SKIP() << tool " is not installed (package systemd); skipped";          \
   }
 
-TEST(Packaging, InstallPutsEveryFileInPlaceAndNothingElse) {
-  TempRoot root;
-  std::string stage = root.dir() + "/stage";
-  install_or_fail(stage, "/usr");
-
-  // Path below the stage, and whether it must be executable. Test, benchmark,
-  // fuzzing and stand-in programs stay in the build tree.
-  std::map<std::string, bool> expected = {
-      {"usr/" + kBin + "/browser-sitedeck-service", true},
-      {"usr/" + kBin + "/sitedeck", true},
-      {"usr/" + kModuleDir + "/libsitedeck-pull.so", false},
-      {"usr/" + kShareDir + "/site_deck_server_data.xml", false},
-      {"usr/" + kUnitDir + "/browser-sitedeck-service.socket", false},
-      {"usr/" + kUnitDir + "/browser-sitedeck-service.service", false},
-      {"usr/lib/tmpfiles.d/browser-sitedeck-service.conf", false},
-  };
-  // The sample default deck: its item list and every icon it names.
-  for (const char* name : {"site_deck_default.json", "news-96.png", "mail-96.png", "maps-96.png",
-                           "weather-96.png", "video-96.png", "shop-96.png", "wiki-96.png"}) {
-    expected["usr/" + kShareDir + "/default-deck/" + name] = false;
-  }
-  std::map<std::string, bool> installed = files_below(stage);
-  // The module is loaded, never executed: whether it carries the executable
-  // bit is the platform's custom.
-  auto module = installed.find("usr/" + kModuleDir + "/libsitedeck-pull.so");
-  if (module != installed.end()) module->second = false;
-  EXPECT_EQ(installed, expected);
-
-  // The sample server list is the one in the source tree, byte for byte.
-  EXPECT_EQ(read_file(stage + "/usr/" + kShareDir + "/site_deck_server_data.xml"),
-            read_file(std::string(SITEDECK_SOURCE_DIR) + "/packaging/site_deck_server_data.xml"));
-}
-
-// The units and the tmpfiles.d entry name installed files: they must name
-// them for the prefix chosen when installing, not the one of the build.
-TEST(Packaging, UnitsAndTmpfilesNameTheInstalledFilesForEachPrefix) {
-  struct Case {
-    const char* prefix;
-    std::string service;
-    std::string server_list;
-  };
-  const Case cases[] = {
-      {"/usr", "/usr/" + kBin + "/browser-sitedeck-service",
-       "/usr/" + kShareDir + "/site_deck_server_data.xml"},
-      {"/opt/sitedeck", "/opt/sitedeck/" + kBin + "/browser-sitedeck-service",
-       "/opt/sitedeck/" + kShareDir + "/site_deck_server_data.xml"},
-  };
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.prefix);
+// For each prefix chosen when installing: exactly the expected files with
+// their executable bits, and units and a tmpfiles.d entry that name the
+// installed files for that prefix, not the one of the build.
+TEST(Packaging, InstallPutsEveryFileInPlaceAndNamesItForEachPrefix) {
+  for (const std::string prefix : {"/usr", "/opt/sitedeck"}) {
+    SCOPED_TRACE(prefix);
     TempRoot root;
-    std::string stage = root.dir() + "/stage";
-    install_or_fail(stage, c.prefix);
-    std::string base = stage + c.prefix;
-    std::string service = read_file(base + "/" + kUnitDir + "/browser-sitedeck-service.service");
-    EXPECT_EQ(unit_setting(service, "ExecStart"), c.service);
-    EXPECT_TRUE(file_exists(stage + c.service));
-    EXPECT_EQ(service.find("@SITEDECK_"), std::string::npos) << "a placeholder was left unfilled";
-    EXPECT_EQ(unit_setting(service, "ReadWritePaths"), SDS_DATA_DIR);
+    const std::string stage = root.dir() + "/stage", base = stage + prefix;
+    install_or_fail(stage, prefix);
+    // Below the stage, and whether it must be executable. Test, benchmark,
+    // fuzzing and stand-in programs stay in the build tree.
+    const std::string p = prefix.substr(1) + "/";
+    std::map<std::string, bool> expected = {
+        {p + kBin + "/browser-sitedeck-service", true},
+        {p + kBin + "/sitedeck", true},
+        {p + kModuleDir + "/libsitedeck-pull.so", false},
+        {p + kShareDir + "/site_deck_server_data.xml", false},
+        {p + kUnitDir + "/browser-sitedeck-service.socket", false},
+        {p + kUnitDir + "/browser-sitedeck-service.service", false},
+        {p + "lib/tmpfiles.d/browser-sitedeck-service.conf", false},
+    };
+    // The sample default deck: its item list and every icon it names.
+    for (const char* name : {"site_deck_default.json", "news-96.png", "mail-96.png", "maps-96.png",
+                             "weather-96.png", "video-96.png", "shop-96.png", "wiki-96.png"}) {
+      expected[p + kShareDir + "/default-deck/" + name] = false;
+    }
+    std::map<std::string, bool> installed = files_below(stage);
+    // The module is loaded, never executed: whether it carries the
+    // executable bit is the platform's custom.
+    auto module = installed.find(p + kModuleDir + "/libsitedeck-pull.so");
+    if (module != installed.end()) module->second = false;
+    EXPECT_EQ(installed, expected);
+    // The sample server list is the one in the source tree, byte for byte.
+    const std::string server_list = prefix + "/" + kShareDir + "/site_deck_server_data.xml";
+    EXPECT_EQ(read_file(stage + server_list),
+              read_file(std::string(SITEDECK_SOURCE_DIR) + "/packaging/site_deck_server_data.xml"));
 
+    std::string service = read_file(base + "/" + kUnitDir + "/browser-sitedeck-service.service");
+    EXPECT_EQ(unit_setting(service, "ExecStart"),
+              prefix + "/" + kBin + "/browser-sitedeck-service");
+    EXPECT_EQ(unit_setting(service, "ReadWritePaths"), SDS_DATA_DIR);
     std::string socket = read_file(base + "/" + kUnitDir + "/browser-sitedeck-service.socket");
     EXPECT_EQ(unit_setting(socket, "ListenStream"), SDS_SOCKET_PATH);
     EXPECT_EQ(unit_setting(socket, "Accept"), "no");
-
     std::string tmpfiles = read_file(base + "/lib/tmpfiles.d/browser-sitedeck-service.conf");
-    std::string copy_line = std::string("C ") + SDS_SERVER_DATA_XML + " - - - - " + c.server_list;
-    EXPECT_NE(tmpfiles.find(copy_line + "\n"), std::string::npos) << tmpfiles;
-    EXPECT_EQ(tmpfiles.find("@SITEDECK_"), std::string::npos) << "a placeholder was left unfilled";
+    EXPECT_NE(
+        tmpfiles.find(std::string("C ") + SDS_SERVER_DATA_XML + " - - - - " + server_list + "\n"),
+        std::string::npos)
+        << tmpfiles;
+    EXPECT_EQ((service + tmpfiles).find("@SITEDECK_"), std::string::npos)
+        << "a placeholder was left";
   }
 }
 
