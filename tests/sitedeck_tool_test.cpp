@@ -3,11 +3,6 @@
 // that `icon -o` writes, and how failures and bad usage are reported.
 #include <gtest/gtest.h>
 #include <json-glib/json-glib.h>
-#include <poll.h>
-#include <pty.h>
-#include <signal.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <memory>
 #include <regex>
@@ -219,46 +214,18 @@ TEST_F(SitedeckTool, NoColourEscapesUnlessStdoutIsATerminalOrColoursAreForced) {
       << result.out;
 }
 
-// Runs the tool on a pseudo-terminal `columns` wide, as a person would, and
-// returns what it printed there (line ends as the terminal makes them).
-std::string RunOnTerminal(const std::vector<std::string>& argv, unsigned short columns) {
-  struct winsize size {};
-  size.ws_row = 24;
-  size.ws_col = columns;
-  int master = -1;
-  pid_t pid = forkpty(&master, nullptr, nullptr, &size);
-  if (pid < 0) return "";
-  if (pid == 0) {
-    setenv("TERM", "xterm-256color", 1);
-    unsetenv("NO_COLOR");
-    std::vector<char*> args;
-    for (const auto& arg : argv) args.push_back(const_cast<char*>(arg.c_str()));
-    args.push_back(nullptr);
-    execv(args[0], args.data());
-    _exit(127);
-  }
-  std::string out;
-  char buffer[4096];
-  for (;;) {
-    struct pollfd entry = {master, POLLIN, 0};
-    if (poll(&entry, 1, 20000) != 1) {
-      kill(pid, SIGKILL);
-      break;
-    }
-    ssize_t got = read(master, buffer, sizeof buffer);
-    if (got <= 0) break;  // EIO once the tool has ended
-    out.append(buffer, static_cast<size_t>(got));
-  }
-  close(master);
-  int status = 0;
-  (void)waitpid(pid, &status, 0);
-  return out;
+// Runs the tool on a pseudo-terminal 60 columns wide (util-linux's script),
+// as a person would; what it printed there, line ends as the terminal makes them.
+std::string RunOnTerminal(const std::string& arguments) {
+  return run_process({"/usr/bin/script", "-qec",
+                      "stty cols 60 && env -u NO_COLOR TERM=xterm-256color " +
+                          std::string(SITEDECK_BIN_DIR) + "/sitedeck " + arguments,
+                      "/dev/null"})
+      .out;
 }
 
 TEST_F(SitedeckTool, OnATerminalTheTableFitsItsWidthAndHasColours) {
-  const std::string out = RunOnTerminal(
-      {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "--socket", service_.socket_path(), "list"},
-      60);
+  const std::string out = RunOnTerminal("--socket " + service_.socket_path() + " list");
   EXPECT_NE(out.find("\033[1mID\033[0m"), std::string::npos) << out;
   EXPECT_NE(out.find("\033[48;2;170;0;0m  \033[0m #AA0000"), std::string::npos) << out;
   EXPECT_NE(out.find("\r\n5   A very lo\xE2\x80\xA6  https://fi\xE2\x80\xA6  "), std::string::npos)
