@@ -19,6 +19,7 @@
 
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-server-data.h"
+#include "support/pull_env.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"
 #include "support/temp_root.h"
@@ -27,13 +28,6 @@ namespace {
 
 // 2020-01-01 00:00:00 UTC, the database's time stamp in the seeded root.
 constexpr time_t kDatabaseTime = 1577836800;
-
-const char kServerList[] =
-    "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<values>"
-    "<Server><Id>1</Id><Base-url>http://127.0.0.1:8080/</Base-url><WaitTime>500</WaitTime>"
-    "<RetryCount>3</RetryCount><FallBack>false</FallBack></Server>"
-    "<Server><Id>2</Id><Base-url>https://backup.example/deck/</Base-url><WaitTime>60000</WaitTime>"
-    "<RetryCount>1</RetryCount><FallBack>true</FallBack></Server></values>\n";
 
 // Size and modification time of every file below `dir`, to show that
 // nothing was written.
@@ -88,7 +82,8 @@ class SitedeckStatus : public ::testing::Test {
   }
 
   void Seed() {
-    ASSERT_TRUE(write_file(root_.path(SDS_SERVER_DATA_XML), kServerList));
+    ASSERT_TRUE(write_server_list({{1, "http://127.0.0.1:8080/", 500, 3, false},
+                                   {2, "https://backup.example/deck/", 60000, 1, true}}));
     ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "3600"));
     sds_server_req_args args{};
     args.latitude = 37.5;

@@ -14,6 +14,7 @@
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
+#include "support/pull_env.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
@@ -249,12 +250,7 @@ TEST(SitedeckToolInit, PrintsThePullResultAndListsWhatWasPulled) {
   GeocoderProcess geocoder;
   ASSERT_TRUE(content.ok() && geocoder.ok());
   ASSERT_TRUE(kdb_write("db/browser/sitedeck/geocoder_url", geocoder.root_url().c_str()));
-  ASSERT_TRUE(write_file(root.path(SDS_SERVER_DATA_XML),
-                         "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<values><Server><Id>1</Id>"
-                         "<Base-url>" +
-                             content.base_url() + "</Base-url>" +
-                             "<WaitTime>0</WaitTime><RetryCount>1</RetryCount>"
-                             "<FallBack>false</FallBack></Server></values>\n"));
+  ASSERT_TRUE(write_server_list({{1, content.base_url(), 0, 1, false}}));
   ServiceHarness service;
   ASSERT_TRUE(service.start_activated(/*once=*/false));
   const std::string tool = std::string(SITEDECK_BIN_DIR) + "/sitedeck";
