@@ -41,16 +41,6 @@ void open_like_the_worker() {
   sds_default_deck_load_if_created();
 }
 
-std::string bgra_of(const sds_client_icon& icon) {
-  return std::string(reinterpret_cast<const char*>(icon.pixels.get()),
-                     static_cast<size_t>(icon.byte_count));
-}
-
-std::string bgra_of(const PngImage& image) {
-  std::vector<uint8_t> bytes = png_expected_bgra(image);
-  return std::string(bytes.begin(), bytes.end());
-}
-
 class DefaultDeckService : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -112,7 +102,10 @@ TEST_F(DefaultDeckService, FirstStartServesTheDeckAndTheFirstPullReplacesIt) {
     ASSERT_EQ(item.icon_status, SDS_ERROR_NONE) << deck[i].url;
     EXPECT_EQ(item.icon.width, deck[i].image.width) << i;
     EXPECT_EQ(item.icon.height, deck[i].image.height) << i;
-    EXPECT_EQ(bgra_of(item.icon), bgra_of(deck[i].image)) << i;
+    const unsigned char* pixels = item.icon.pixels.get();
+    EXPECT_EQ(std::vector<uint8_t>(pixels, pixels + item.icon.byte_count),
+              png_expected_bgra(deck[i].image))
+        << i;
   }
   EXPECT_TRUE(service.has_message("default deck loaded: 3 items (0 icon files missing)"))
       << service.output();

@@ -201,6 +201,10 @@ TEST_F(SitedeckToolMessages, EverySubcommandHasHelpThatNeedsNoService) {
 
 TEST_F(SitedeckToolMessages, BadUsageIsShortWithAHintAndExitsWithTwo) {
   const std::string hint = "Try 'sitedeck --help' for more information.\n";
+  auto usage = [](const std::string& command, const std::string& synopsis) {
+    return "usage: sitedeck " + command + synopsis + "\nTry 'sitedeck " + command +
+           " --help' for more information.\n";
+  };
   struct Case {
     std::vector<std::string> arguments;
     std::string err;
@@ -211,21 +215,14 @@ TEST_F(SitedeckToolMessages, BadUsageIsShortWithAHintAndExitsWithTwo) {
       {{"--color=sometimes", "list"}, "sitedeck: --color takes auto, always or never\n" + hint},
       {{"list", "--color"}, "sitedeck: --color takes auto, always or never\n" + hint},
       {{"help", "frobnicate"}, "sitedeck: no help for frobnicate: not a command\n" + hint},
-      {{"status", "extra"},
-       "usage: sitedeck status\nTry 'sitedeck status --help' for more information.\n"},
+      {{"status", "extra"}, usage("status", "")},
       // No service listens here: the arguments are judged before connecting,
       // so bad usage is never reported as an unreachable service.
-      {{"show", "x"},
-       "usage: sitedeck show ID\nTry 'sitedeck show --help' for more information.\n"},
-      {{"icon", "3"},
-       "usage: sitedeck icon ID -o FILE\nTry 'sitedeck icon --help' for more information.\n"},
-      {{"init", "--lat", "1"},
-       "usage: sitedeck init --lat LAT --lon LON [--version V]\n"
-       "Try 'sitedeck init --help' for more information.\n"},
-      {{"list", "extra"},
-       "usage: sitedeck list\nTry 'sitedeck list --help' for more information.\n"},
-      {{"show", "-1"},
-       "usage: sitedeck show ID\nTry 'sitedeck show --help' for more information.\n"},
+      {{"show", "x"}, usage("show", " ID")},
+      {{"icon", "3"}, usage("icon", " ID -o FILE")},
+      {{"init", "--lat", "1"}, usage("init", " --lat LAT --lon LON [--version V]")},
+      {{"list", "extra"}, usage("list", "")},
+      {{"show", "-1"}, usage("show", " ID")},
   };
   for (const auto& c : cases) {
     ProcessResult result = sitedeck(c.arguments);

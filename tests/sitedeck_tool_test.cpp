@@ -197,11 +197,8 @@ TEST_F(SitedeckTool, NextUpdatePrintsTheSecondsAndTheSimpleCommandsHaveJson) {
 }
 
 TEST_F(SitedeckTool, NoColourEscapesUnlessStdoutIsATerminalOrColoursAreForced) {
-  for (const auto& arguments :
-       std::vector<std::vector<std::string>>{{"list"},
-                                             {"show", "7"},
-                                             {"--color=auto", "list"},
-                                             {"--json", "--color=always", "list"}}) {
+  for (const auto& arguments : std::vector<std::vector<std::string>>{
+           {"show", "7"}, {"--color=auto", "list"}, {"--json", "--color=always", "list"}}) {
     ProcessResult result = sitedeck(arguments);
     EXPECT_EQ(result.exit_code, 0) << arguments[0];
     EXPECT_EQ(result.out.find('\033'), std::string::npos) << arguments[0] << result.out;
