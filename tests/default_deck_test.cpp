@@ -4,9 +4,7 @@
 #include "support/default_deck.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
-#include <cstring>
 #include <filesystem>
 #include <string>
 #include <vector>

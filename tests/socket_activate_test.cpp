@@ -12,7 +12,6 @@
 
 #include <cerrno>
 #include <csignal>
-#include <cstring>
 #include <filesystem>
 #include <string>
 #include <vector>
