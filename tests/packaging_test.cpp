@@ -59,15 +59,23 @@ void install_or_fail(const std::string& stage, const std::string& prefix) {
     GTEST_SKIP() << tool " is not installed (package systemd); skipped";          \
   }
 
+// Every case starts from an installation for /usr below `stage_`.
+class Packaging : public ::testing::Test {
+ protected:
+  void SetUp() override { install_or_fail(stage_, "/usr"); }
+  TempRoot root_;
+  const std::string stage_ = root_.dir() + "/stage";
+};
+
 // For each prefix chosen when installing: exactly the expected files with
 // their executable bits, and units and a tmpfiles.d entry that name the
 // installed files for that prefix, not the one of the build.
-TEST(Packaging, InstallPutsEveryFileInPlaceAndNamesItForEachPrefix) {
+TEST_F(Packaging, InstallPutsEveryFileInPlaceAndNamesItForEachPrefix) {
   for (const std::string prefix : {"/usr", "/opt/sitedeck"}) {
     SCOPED_TRACE(prefix);
-    TempRoot root;
-    const std::string stage = root.dir() + "/stage", base = stage + prefix;
-    install_or_fail(stage, prefix);
+    const std::string stage = prefix == "/usr" ? stage_ : root_.dir() + "/other-stage";
+    if (stage != stage_) install_or_fail(stage, prefix);
+    const std::string base = stage + prefix;
     // Below the stage, and whether it must be executable. Test, benchmark,
     // fuzzing and stand-in programs stay in the build tree.
     const std::string p = prefix.substr(1) + "/";
@@ -115,12 +123,9 @@ TEST(Packaging, InstallPutsEveryFileInPlaceAndNamesItForEachPrefix) {
 
 // The installed binary lives apart from its module (bin/ and lib/): it must
 // still load the module, and the one of its own installation.
-TEST(Packaging, InstalledServiceLoadsItsInstalledPullModule) {
-  TempRoot root;
-  std::string stage = root.dir() + "/stage";
-  install_or_fail(stage, "/usr");
+TEST_F(Packaging, InstalledServiceLoadsItsInstalledPullModule) {
   ServiceHarness service;
-  service.set_service_path(stage + "/usr/" + kBin + "/browser-sitedeck-service");
+  service.set_service_path(stage_ + "/usr/" + kBin + "/browser-sitedeck-service");
   ASSERT_TRUE(service.start_direct());
   SdsConnection connection;
   ASSERT_EQ(service.connect(&connection), SDS_ERROR_NONE) << service.output();
@@ -134,7 +139,7 @@ TEST(Packaging, InstalledServiceLoadsItsInstalledPullModule) {
     size_t at = line.find("/libsitedeck-pull.so");
     if (at != std::string::npos) mapped_module = line.substr(line.find('/'));
   }
-  std::string installed_module = stage + "/usr/" + kModuleDir + "/libsitedeck-pull.so";
+  std::string installed_module = stage_ + "/usr/" + kModuleDir + "/libsitedeck-pull.so";
   EXPECT_EQ(fs::path(mapped_module), fs::canonical(installed_module));
   EXPECT_FALSE(service.has_message_matching(R"(\[CRITICAL\] cannot load .*)")) << service.output();
   connection.close();
@@ -143,16 +148,13 @@ TEST(Packaging, InstalledServiceLoadsItsInstalledPullModule) {
   EXPECT_EQ(exit_code_of(status), 0) << service.output();
 }
 
-TEST(Packaging, TmpfilesCreatesTheDataDirectoriesAndCopiesTheServerListOnce) {
+TEST_F(Packaging, TmpfilesCreatesTheDataDirectoriesAndCopiesTheServerListOnce) {
   REQUIRE_TOOL(tmpfiles, "systemd-tmpfiles");
-  TempRoot root;
-  std::string stage = root.dir() + "/stage";
-  install_or_fail(stage, "/usr");
-  // The entry is read from the stage; its paths, the copy's source included,
+  // The entry is read from the stage_; its paths, the copy's source included,
   // are taken below --root.
   const std::vector<std::string> create = {
-      tmpfiles, "--create", "--root=" + stage,
-      stage + "/usr/lib/tmpfiles.d/browser-sitedeck-service.conf"};
+      tmpfiles, "--create", "--root=" + stage_,
+      stage_ + "/usr/lib/tmpfiles.d/browser-sitedeck-service.conf"};
   ProcessResult result = run_process(create);
   ASSERT_TRUE(result.finished);
   ASSERT_EQ(result.exit_code, 0) << result.err;
@@ -168,16 +170,16 @@ TEST(Packaging, TmpfilesCreatesTheDataDirectoriesAndCopiesTheServerListOnce) {
   };
   for (const auto& d : dirs) {
     SCOPED_TRACE(d.path);
-    EXPECT_TRUE(fs::is_directory(stage + d.path));
-    EXPECT_EQ(mode_of(stage + d.path), d.mode);
+    EXPECT_TRUE(fs::is_directory(stage_ + d.path));
+    EXPECT_EQ(mode_of(stage_ + d.path), d.mode);
   }
-  std::string server_list = stage + SDS_SERVER_DATA_XML;
-  std::string sample = read_file(stage + "/usr/" + kShareDir + "/site_deck_server_data.xml");
+  std::string server_list = stage_ + SDS_SERVER_DATA_XML;
+  std::string sample = read_file(stage_ + "/usr/" + kShareDir + "/site_deck_server_data.xml");
   EXPECT_EQ(read_file(server_list), sample);
   // The default deck arrives whole, ready for a first start.
-  EXPECT_EQ(read_file(stage + SDS_DEFAULT_DECK_JSON_PATH),
-            read_file(stage + "/usr/" + kShareDir + "/default-deck/site_deck_default.json"));
-  EXPECT_TRUE(file_exists(stage + SDS_DEFAULT_DECK_DIR + std::string("/wiki-96.png")));
+  EXPECT_EQ(read_file(stage_ + SDS_DEFAULT_DECK_JSON_PATH),
+            read_file(stage_ + "/usr/" + kShareDir + "/default-deck/site_deck_default.json"));
+  EXPECT_TRUE(file_exists(stage_ + SDS_DEFAULT_DECK_DIR + std::string("/wiki-96.png")));
 
   // The service rewrites the list when a server moves for good: running the
   // entry again (every boot does) must keep that.
@@ -189,7 +191,7 @@ TEST(Packaging, TmpfilesCreatesTheDataDirectoriesAndCopiesTheServerListOnce) {
   EXPECT_EQ(read_file(server_list), moved);
 }
 
-TEST(Packaging, SystemdAcceptsTheInstalledUnitsAndTheirSandbox) {
+TEST_F(Packaging, SystemdAcceptsTheInstalledUnitsAndTheirSandbox) {
   REQUIRE_TOOL(analyze, "systemd-analyze");
   std::string system_units;
   for (const char* dir : {"/usr/lib/systemd/system", "/lib/systemd/system"}) {
@@ -200,18 +202,15 @@ TEST(Packaging, SystemdAcceptsTheInstalledUnitsAndTheirSandbox) {
     if (systemd_tools_required()) FAIL() << "systemd's own units are missing";
     GTEST_SKIP() << "systemd's own units (sockets.target) are not installed; skipped";
   }
-  TempRoot root;
-  std::string stage = root.dir() + "/stage";
-  install_or_fail(stage, "/usr");
-  // Verifying below --root checks ExecStart in the stage; the units' default
+  // Verifying below --root checks ExecStart in the stage_; the units' default
   // dependencies (sysinit.target, sockets.target) must be found there too,
   // so systemd's own units are copied beside them.
-  fs::create_directories(stage + "/lib/systemd");
-  fs::copy(system_units, stage + "/lib/systemd/system",
+  fs::create_directories(stage_ + "/lib/systemd");
+  fs::copy(system_units, stage_ + "/lib/systemd/system",
            fs::copy_options::recursive | fs::copy_options::copy_symlinks);
 
   ProcessResult verify =
-      run_process({analyze, "verify", "--root=" + stage, "browser-sitedeck-service.socket",
+      run_process({analyze, "verify", "--root=" + stage_, "browser-sitedeck-service.socket",
                    "browser-sitedeck-service.service"});
   ASSERT_TRUE(verify.finished);
   EXPECT_EQ(verify.exit_code, 0) << verify.err;
@@ -221,7 +220,7 @@ TEST(Packaging, SystemdAcceptsTheInstalledUnitsAndTheirSandbox) {
   // systemd's own rating of the sandbox, 0 (tight) to 10 (open): the service
   // needs the network, /dev/shm and root's chown, which alone cost about 2.5.
   ProcessResult security = run_process({analyze, "security", "--offline=yes", "--threshold=30",
-                                        "--root=" + stage, "browser-sitedeck-service.service"});
+                                        "--root=" + stage_, "browser-sitedeck-service.service"});
   ASSERT_TRUE(security.finished);
   EXPECT_EQ(security.exit_code, 0) << security.out << security.err;
 }
