@@ -1,6 +1,7 @@
 // The `sitedeck` command line against the real service under the activator,
 // with a seeded database: the table of `list`, the fields of `show`, the PNG
-// that `icon -o` writes, and how failures and bad usage are reported.
+// that `icon -o` writes, JSON and colours, and how failures are reported
+// (bad usage is in sitedeck_tool_messages_test.cpp).
 #include <gtest/gtest.h>
 #include <json-glib/json-glib.h>
 
