@@ -69,18 +69,14 @@ TEST_F(ServerDataTest, TwoServersInFileOrderAndTheirLogLines) {
   LogCapture log;
   print_server_data(head);
   const std::string rule(49, '+');
-  auto block = [&rule](const std::string& url, const char* id, const char* wait, const char* retry,
-                       const char* fall_back) {
-    return std::vector<std::string>{rule,
-                                    "[INFO] Server base_url    " + url,
-                                    std::string("[INFO] Server Id          ") + id,
-                                    std::string("[INFO] Server wait_time   ") + wait,
-                                    std::string("[INFO] Server retry_count ") + retry,
-                                    std::string("[INFO] Server fall_back   ") + fall_back,
-                                    rule};
-  };
-  std::vector<std::string> expected = block("https://a.example/list", "1", "5000", "3", "0");
-  for (auto& line : block("https://b.example/list", "2", "100", "1", "1")) expected.push_back(line);
+  std::vector<std::string> expected;
+  for (const auto& v : {std::vector<std::string>{"https://a.example/list", "1", "5000", "3", "0"},
+                        std::vector<std::string>{"https://b.example/list", "2", "100", "1", "1"}}) {
+    expected.insert(expected.end(),
+                    {rule, "[INFO] Server base_url    " + v[0], "[INFO] Server Id          " + v[1],
+                     "[INFO] Server wait_time   " + v[2], "[INFO] Server retry_count " + v[3],
+                     "[INFO] Server fall_back   " + v[4], rule});
+  }
   std::vector<std::string> got;
   for (const auto& line : log.lines()) {
     EXPECT_EQ(line.prio, 4) << line.message;
