@@ -69,6 +69,11 @@ TEST_F(ItemParseTest, SectionsChooseTheItemArrays) {
       {"items null", R"({"items": null})", V{}},
       {"number elements skipped", R"({"items": [1, )" + item("a") + ", \"s\", " + item("b") + "]}",
        V{"a", "b"}},
+      // The empty element's item is created, then the parse stops.
+      {"element without members stops", R"({"items": [)" + item("a") + ", {}, " + item("c") + "]}",
+       V{"a", "(none)"}},
+      {"body that is no object", R"({"items": [{"s": "text"}, {"s": [1, 2]}, )" + item("c") + "]}",
+       V{"(none)", "(none)", "c"}},
   };
   for (const auto& c : cases) {
     sds_free_item_list();
@@ -132,11 +137,11 @@ TEST_F(ItemParseTest, IconEntriesFillTheirFields) {
   EXPECT_STREQ(list[1]->icon_size, "");
   EXPECT_EQ(list[2]->id, 9);
   EXPECT_STREQ(list[2]->icon_size, "");
-}
 
-TEST_F(ItemParseTest, TouchIconsObjectGivesOneIconPerMember) {
+  // An object gives one icon per member.
+  sds_free_item_list();
   parse(R"({"items": [{"s": {"touchIcons": {"small": {"id": 3}, "large": {"id": 4}}}}]})");
-  auto list = icons(items().at(0));
+  list = icons(items().at(0));
   ASSERT_EQ(list.size(), 2u);
   EXPECT_EQ(list[0]->id, 3);
   EXPECT_EQ(list[1]->id, 4);
@@ -149,19 +154,6 @@ TEST_F(ItemParseTest, OverlongIconSizeAndLastModifiedAreCutAtFieldSize) {
   ASSERT_EQ(list.size(), 1u);
   EXPECT_STREQ(list[0]->icon_size, "12345678901");
   EXPECT_STREQ(list[0]->last_modified, "Tue, 15 Nov 1994 12:45:");
-}
-
-TEST_F(ItemParseTest, ItemElementWithoutMembersStopsTheParse) {
-  parse(R"({"items": [)" + item("a") + ", {}, " + item("c") + "]}");
-  auto all = items();
-  ASSERT_EQ(all.size(), 2u);
-  EXPECT_STREQ(all[0]->site_url, "a");
-  EXPECT_EQ(all[1]->site_url, nullptr);  // created, then the parse stopped
-}
-
-TEST_F(ItemParseTest, BodyThatIsNoObjectGivesAnEmptyItem) {
-  parse(R"({"items": [{"s": "text"}, {"s": [1, 2]}, )" + item("c") + "]}");
-  EXPECT_EQ(urls(), (std::vector<std::string>{"(none)", "(none)", "c"}));
 }
 
 TEST_F(ItemParseTest, SecondCallLeavesTheExistingListAlone) {

@@ -37,9 +37,17 @@ std::string data(const char* key, const std::string& text) {
 
 class LocationXmlTest : public ::testing::Test {
  protected:
+  // Writes `answer` as the geocoder's answer and reads it into `args_`:
+  // "RESULT CITY|PROVINCE", "(none)" for a text not set.
+  std::string parse(const std::string& answer) {
+    EXPECT_TRUE(write_file(answer_path_, answer));
+    const int result = sds_parse_city_and_province(&args_);
+    return std::to_string(result) + " " + args_.city_text() + "|" + args_.province_text();
+  }
   TempRoot root_;
   std::string stored_path_ = root_.path(SDS_LOCATION_INFO_PATH);
   std::string answer_path_ = root_.path(SDS_HERE_XML_PATH);
+  Args args_{37.5, 127.0};
 };
 
 TEST_F(LocationXmlTest, PositionTextHasSixDecimals) {
@@ -50,195 +58,143 @@ TEST_F(LocationXmlTest, PositionTextHasSixDecimals) {
   EXPECT_EQ(std::string(huge.get()).substr(0, 2), "-1");
 }
 
-TEST_F(LocationXmlTest, StoredAnswerIsReusedForTheSamePosition) {
-  ASSERT_TRUE(write_file(stored_path_, stored("<LatitudeLongitude>" + kPosition +
-                                              "</LatitudeLongitude><City>Suwon</City>"
-                                              "<Province>Gyeonggi-do</Province>")));
-  Args args(37.5, 127.0);
-  EXPECT_EQ(get_city_and_province_from_stored(&args), 0);
-  EXPECT_EQ(args.city_text(), "Suwon");
-  EXPECT_EQ(args.province_text(), "Gyeonggi-do");
-}
-
-TEST_F(LocationXmlTest, StoredAnswerOfAnotherPositionIsNotUsed) {
-  ASSERT_TRUE(write_file(stored_path_, stored("<LatitudeLongitude>" + kPosition +
-                                              "</LatitudeLongitude><City>Suwon</City>"
-                                              "<Province>Gyeonggi-do</Province>")));
-  LogCapture log;
-  Args args(37.500001, 127.0);
-  EXPECT_EQ(get_city_and_province_from_stored(&args), -1);
-  EXPECT_TRUE(log.contains("Longitude and latitude didn't match with previous"));
-  EXPECT_EQ(args.city, nullptr);
-  EXPECT_EQ(args.province, nullptr);
-}
-
 TEST_F(LocationXmlTest, StoredFileVariants) {
+  const std::string place = "<City>Suwon</City><Province>Gyeonggi-do</Province>";
   struct Case {
     const char* name;
     std::string content;
     int result;
     const char* city;
     const char* province;
+    std::string logged;  // empty: not checked
   } cases[] = {
-      {"city without province", stored("<City>Suwon</City>"), 0, "Suwon", "(none)"},
+      {"same position", stored("<LatitudeLongitude>" + kPosition + "</LatitudeLongitude>" + place),
+       0, "Suwon", "Gyeonggi-do", ""},
+      {"another position",
+       stored("<LatitudeLongitude>37.500001,127.000000</LatitudeLongitude>" + place), -1, "(none)",
+       "(none)", "Longitude and latitude didn't match with previous"},
+      {"city without province", stored("<City>Suwon</City>"), 0, "Suwon", "(none)", ""},
       {"position without text matches", stored("<LatitudeLongitude/><City/><Province>P</Province>"),
-       0, "", "P"},
-      {"other children skipped", stored("<Note>x</Note><City>C</City>"), 0, "C", "(none)"},
-      {"wrong root", "<Place><City>C</City></Place>", 0, "(none)", "(none)"},
-      {"not XML", "<Location>", -1, "(none)", "(none)"},
+       0, "", "P", ""},
+      {"other children skipped", stored("<Note>x</Note><City>C</City>"), 0, "C", "(none)", ""},
+      {"wrong root", "<Place><City>C</City></Place>", 0, "(none)", "(none)",
+       "Wrong XML data in  - " + stored_path_},
+      {"not XML", "<Location>", -1, "(none)", "(none)", ""},
   };
   for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
     ASSERT_TRUE(write_file(stored_path_, c.content));
     LogCapture log;
     Args args(37.5, 127.0);
-    EXPECT_EQ(get_city_and_province_from_stored(&args), c.result) << c.name;
-    EXPECT_EQ(args.city_text(), c.city) << c.name;
-    EXPECT_EQ(args.province_text(), c.province) << c.name;
-    if (std::string(c.name) == "wrong root") {
-      EXPECT_TRUE(log.contains("Wrong XML data in  - " + stored_path_));
+    EXPECT_EQ(get_city_and_province_from_stored(&args), c.result);
+    EXPECT_EQ(args.city_text(), c.city);
+    EXPECT_EQ(args.province_text(), c.province);
+    if (!c.logged.empty()) {
+      EXPECT_TRUE(log.contains(c.logged));
     }
   }
   std::remove(stored_path_.c_str());
-  Args args(37.5, 127.0);
   LogCapture log;
-  EXPECT_EQ(get_city_and_province_from_stored(&args), -1);
+  EXPECT_EQ(get_city_and_province_from_stored(&args_), -1);
   EXPECT_TRUE(log.lines().empty());
 }
 
 TEST_F(LocationXmlTest, AnswerGivesLastCountyAndStateAndIsRemoved) {
-  ASSERT_TRUE(write_file(
-      answer_path_,
-      "<?xml version=\"1.0\"?><ns2:Search xmlns:ns2=\"http://www.navteq.com/lbsp/Search-Search/4\">"
-      "<Response><View><Result><Location><Address>" +
-          data("CountyName", "First County") + data("StateName", "First State") +
-          data("Other", "x") + "</Address></Location></Result><Result><Location><Address>" +
-          data("CountyName", "Second County") + "<Deeper>" + data("StateName", "Second State") +
-          "</Deeper></Address></Location></Result></View></Response></ns2:Search>"));
-  Args args(37.5, 127.0);
-  args.city = strdup("stale");
-  EXPECT_EQ(sds_parse_city_and_province(&args), 0);
-  EXPECT_EQ(args.city_text(), "Second County");
-  EXPECT_EQ(args.province_text(), "Second State");
+  args_.city = strdup("stale");
+  EXPECT_EQ(
+      parse("<?xml version=\"1.0\"?><ns2:Search xmlns:ns2=\"http://www.navteq.com/lbsp/Search-"
+            "Search/4\"><Response><View><Result><Location><Address>" +
+            data("CountyName", "First County") + data("StateName", "First State") +
+            data("Other", "x") + "</Address></Location></Result><Result><Location><Address>" +
+            data("CountyName", "Second County") + "<Deeper>" + data("StateName", "Second State") +
+            "</Deeper></Address></Location></Result></View></Response></ns2:Search>"),
+      "0 Second County|Second State");
   EXPECT_FALSE(file_exists(answer_path_));
 }
 
 TEST_F(LocationXmlTest, AnswerWithoutCountyLeavesCityNone) {
-  ASSERT_TRUE(write_file(answer_path_, "<Search>" + data("StateName", "") + "</Search>"));
-  Args args(37.5, 127.0);
-  args.city = strdup("stale");
-  EXPECT_EQ(sds_parse_city_and_province(&args), 0);
-  EXPECT_EQ(args.city, nullptr);
-  EXPECT_EQ(args.province_text(), "");
+  args_.city = strdup("stale");
+  EXPECT_EQ(parse("<Search>" + data("StateName", "") + "</Search>"), "0 (none)|");
 }
 
 TEST_F(LocationXmlTest, ErrorAnswerGives18AndKeepsTheFile) {
-  ASSERT_TRUE(
-      write_file(answer_path_, "<ns2:Error xmlns:ns2=\"urn:x\" type=\"PermissionError\"/>"));
   LogCapture log;
-  Args args(37.5, 127.0);
-  EXPECT_EQ(sds_parse_city_and_province(&args), 18);
+  EXPECT_EQ(parse("<ns2:Error xmlns:ns2=\"urn:x\" type=\"PermissionError\"/>"), "18 (none)|(none)");
   EXPECT_EQ(sds_last_error, 18);
   EXPECT_TRUE(log.contains("[CRITICAL] Here service returned error"));
   EXPECT_TRUE(file_exists(answer_path_));
 }
 
 TEST_F(LocationXmlTest, OtherAnswersLeaveCityAndProvinceAlone) {
-  Args args(37.5, 127.0);
-  args.city = strdup("kept");
-  ASSERT_TRUE(write_file(answer_path_, "<Unexpected>" + data("CountyName", "X") + "</Unexpected>"));
-  EXPECT_EQ(sds_parse_city_and_province(&args), 0);
-  EXPECT_EQ(args.city_text(), "kept");
+  args_.city = strdup("kept");
+  EXPECT_EQ(parse("<Unexpected>" + data("CountyName", "X") + "</Unexpected>"), "0 kept|(none)");
   EXPECT_TRUE(file_exists(answer_path_));
 
   LogCapture log;
   std::remove(answer_path_.c_str());
-  EXPECT_EQ(sds_parse_city_and_province(&args), 18);
+  EXPECT_EQ(sds_parse_city_and_province(&args_), 18);
   EXPECT_TRUE(log.contains("[CRITICAL] " + answer_path_ + " file not found"));
-  EXPECT_EQ(args.city_text(), "kept");
+  EXPECT_EQ(args_.city_text(), "kept");
 }
 
 TEST_F(LocationXmlTest, ExternalEntityInAnswerDoesNotReadLocalFiles) {
   const std::string secret = root_.path("/secret.txt");
   ASSERT_TRUE(write_file(secret, "TOP-SECRET"));
-  ASSERT_TRUE(write_file(
-      answer_path_, "<?xml version=\"1.0\"?>\n<!DOCTYPE Search [<!ENTITY leak SYSTEM \"file://" +
-                        secret + "\">]>\n<Search>" + data("CountyName", "&leak;") +
-                        data("StateName", "State &leak;") + "</Search>"));
-  Args args(37.5, 127.0);
-  EXPECT_EQ(sds_parse_city_and_province(&args), 0);
-  EXPECT_EQ(args.city_text(), "");
-  EXPECT_EQ(args.province_text(), "State ");
+  EXPECT_EQ(parse("<?xml version=\"1.0\"?>\n<!DOCTYPE Search [<!ENTITY leak SYSTEM \"file://" +
+                  secret + "\">]>\n<Search>" + data("CountyName", "&leak;") +
+                  data("StateName", "State &leak;") + "</Search>"),
+            "0 |State ");
 }
 
+// An entity reference links to its declaration in the DTD; the walk must not
+// follow that link out of the element tree and around again.
 TEST_F(LocationXmlTest, EntityReferenceInAnswerDoesNotLoopTheWalk) {
-  // An entity reference links to its declaration in the DTD; the walk must
-  // not follow that link out of the element tree and around again.
-  ASSERT_TRUE(write_file(answer_path_, "<!DOCTYPE Search [<!ENTITY town \"Town\">]><Search>" +
-                                           data("CountyName", "&town;") + data("StateName", "S") +
-                                           "</Search>"));
-  Args args(37.5, 127.0);
-  EXPECT_EQ(sds_parse_city_and_province(&args), 0);
-  EXPECT_EQ(args.city_text(), "Town");
-  EXPECT_EQ(args.province_text(), "S");
+  EXPECT_EQ(parse("<!DOCTYPE Search [<!ENTITY town \"Town\">]><Search>" +
+                  data("CountyName", "&town;") + data("StateName", "S") + "</Search>"),
+            "0 Town|S");
 }
 
 TEST_F(LocationXmlTest, EntityExpansionBombIsRefused) {
-  std::string dtd = "<!DOCTYPE Search [<!ENTITY a \"aaaaaaaaaaaaaaaa\">";
-  std::string prev = "a";
+  std::string dtd = "<!DOCTYPE Search [<!ENTITY e0 \"aaaaaaaaaaaaaaaa\">";
   for (int level = 1; level <= 9; ++level) {
-    std::string name = "e" + std::to_string(level);
-    dtd += "<!ENTITY " + name + " \"";
-    for (int i = 0; i < 10; ++i) dtd += "&" + prev + ";";
+    dtd += "<!ENTITY e" + std::to_string(level) + " \"";
+    for (int i = 0; i < 10; ++i) dtd += "&e" + std::to_string(level - 1) + ";";
     dtd += "\">";
-    prev = name;
   }
-  dtd += "]>";
-  ASSERT_TRUE(
-      write_file(answer_path_, dtd + "<Search>" + data("CountyName", "&e9;") + "</Search>"));
-  Args args(37.5, 127.0);
-  EXPECT_EQ(sds_parse_city_and_province(&args), 18);
-  EXPECT_EQ(args.city, nullptr);
+  EXPECT_EQ(parse(dtd + "]><Search>" + data("CountyName", "&e9;") + "</Search>"), "18 (none)|(none)");
 }
 
 TEST_F(LocationXmlTest, OversizeAnswerIsRefusedBeforeParsing) {
-  ASSERT_TRUE(write_file(answer_path_, "<Search>" + data("CountyName", "C") +
-                                           std::string(1024 * 1024, ' ') + "</Search>"));
   LogCapture log;
-  Args args(37.5, 127.0);
-  EXPECT_EQ(sds_parse_city_and_province(&args), 18);
+  EXPECT_EQ(parse("<Search>" + data("CountyName", "C") + std::string(1024 * 1024, ' ') +
+                  "</Search>"),
+            "18 (none)|(none)");
   EXPECT_TRUE(log.contains("[CRITICAL] " + answer_path_ + " is larger than 1048576 bytes"));
-  EXPECT_EQ(args.city, nullptr);
 }
 
+// libxml2 refuses documents deeper than its own limit; anything it accepts is
+// walked iteratively, to the deepest element.
 TEST_F(LocationXmlTest, DeepAnswerIsWalkedWithoutRecursion) {
-  // libxml2 refuses documents deeper than its own limit; anything it accepts
-  // is walked iteratively, to the deepest element.
   std::string open, close;
   for (int i = 0; i < 250; ++i) {
     open += "<n>";
-    close = "</n>" + close;
+    close += "</n>";
   }
-  ASSERT_TRUE(write_file(answer_path_, "<Search>" + open + data("CountyName", "Deep") + close +
-                                           data("StateName", "S") + "</Search>"));
-  Args args(37.5, 127.0);
-  EXPECT_EQ(sds_parse_city_and_province(&args), 0);
-  EXPECT_EQ(args.city_text(), "Deep");
-  EXPECT_EQ(args.province_text(), "S");
+  EXPECT_EQ(parse("<Search>" + open + data("CountyName", "Deep") + close + data("StateName", "S") +
+                  "</Search>"),
+            "0 Deep|S");
 }
 
 TEST_F(LocationXmlTest, WalkCoversTheSiblingsOfTheStartNode) {
-  ASSERT_TRUE(write_file(answer_path_, "<Search><a>" + data("CountyName", "One") + "</a><b><c/>" +
-                                           data("CountyName", "Two") + "</b></Search>"));
-  Args args(37.5, 127.0);
-  EXPECT_EQ(sds_parse_city_and_province(&args), 0);
-  EXPECT_EQ(args.city_text(), "Two");
+  EXPECT_EQ(parse("<Search><a>" + data("CountyName", "One") + "</a><b><c/>" +
+                  data("CountyName", "Two") + "</b></Search>"),
+            "0 Two|(none)");
 }
 
 TEST_F(LocationXmlTest, SaveWritesTheThreeElementsInOrder) {
-  Args args(37.5, 127.0);
-  args.city = strdup("Suwon & Co");
-  args.province = strdup("Gyeonggi-do");
-  save_city_and_province(&args);
+  args_.city = strdup("Suwon & Co");
+  args_.province = strdup("Gyeonggi-do");
+  save_city_and_province(&args_);
   EXPECT_EQ(read_file(stored_path_),
             "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<Location><LatitudeLongitude>" +
                 kPosition +
@@ -251,18 +207,16 @@ TEST_F(LocationXmlTest, SaveWritesTheThreeElementsInOrder) {
 }
 
 TEST_F(LocationXmlTest, SaveNeedsCityAndProvince) {
-  Args args(37.5, 127.0);
-  args.city = strdup("Suwon");
-  args.province = strdup("");
-  save_city_and_province(&args);
+  args_.city = strdup("Suwon");
+  args_.province = strdup("");
+  save_city_and_province(&args_);
   EXPECT_FALSE(file_exists(stored_path_));
 
   LogCapture log;
-  std::free(args.province);
-  args.province = strdup("P");
-  std::string missing_dir = root_.dir() + SDS_SERVER_DIR;
-  ASSERT_EQ(std::system(("rm -rf '" + missing_dir + "'").c_str()), 0);
-  save_city_and_province(&args);
+  std::free(args_.province);
+  args_.province = strdup("P");
+  ASSERT_EQ(std::system(("rm -rf '" + root_.dir() + SDS_SERVER_DIR + "'").c_str()), 0);
+  save_city_and_province(&args_);
   EXPECT_TRUE(log.contains(
       "|xmlTextWriterEndDocument| failed. Couldn't save city and province information"));
 }

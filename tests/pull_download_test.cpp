@@ -58,13 +58,10 @@ class PullDownload : public ::testing::Test {
   static std::string urls() {
     return DbSession::rows("SELECT url FROM site_deck ORDER BY order_index");
   }
-  static int images_left() {
-    int count = 0;
-    for (const auto& entry : std::filesystem::directory_iterator(sds_path(SDS_IMAGES_DIR))) {
-      (void)entry;
-      ++count;
-    }
-    return count;
+  static bool no_images_left() { return std::filesystem::is_empty(sds_path(SDS_IMAGES_DIR)); }
+  static std::string garden_rows() {
+    return DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) +
+                           "'");
   }
 
   DbSession db_;
@@ -94,7 +91,7 @@ TEST_F(PullDownload, FirstPullStoresListAndEtagAsSentAndTheNextRequestIsConditio
   EXPECT_EQ(root_file_or_none(SDS_JSON_RESPONSE_PATH), "<none>");
   EXPECT_EQ(root_file_or_none(SDS_HEADER_RESPONSE_PATH), "<none>");
   EXPECT_EQ(root_file_or_none(SDS_NEXT_UPDATE_DURATION_PATH), "3600");
-  EXPECT_EQ(images_left(), 0);
+  EXPECT_TRUE(no_images_left());
 
   EXPECT_EQ(pull(), SDS_ERROR_HTTP_NOT_MODIFIED);
   EXPECT_EQ(stat("last_if_none_match"), etag);
@@ -226,9 +223,7 @@ TEST_F(PullDownload, FailedIconKeepsTheOldEtagAndAsksAgainInADay) {
   EXPECT_TRUE(log.contains("[CRITICAL]  Failed to Download the Icon"));
   EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), etag);
   EXPECT_EQ(root_file_or_none(SDS_NEXT_UPDATE_DURATION_PATH), "86400");
-  EXPECT_EQ(
-      DbSession::rows("SELECT count(*) FROM site_deck WHERE url = 'http://garden-life.example/'"),
-      "0");
+  EXPECT_EQ(garden_rows(), "0");
   EXPECT_EQ(first_pixel_hex(kHerald), herald_pixel);
 
   ASSERT_EQ(rmdir(icon_file.get()), 0);
@@ -254,12 +249,10 @@ TEST_F(PullDownload, EtagOfAListTheMergeRolledBackWasKept) {
   sqlite3_close(writer);
   EXPECT_EQ(table(), before);
   EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), etag);
-  EXPECT_EQ(images_left(), 0);
+  EXPECT_TRUE(no_images_left());
 
   EXPECT_EQ(pull(), SDS_ERROR_NONE);
-  EXPECT_EQ(
-      DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) + "'"),
-      "0");
+  EXPECT_EQ(garden_rows(), "0");
 }
 
 TEST_F(PullDownload, AnswerWithoutEtagDeletesTheStoredOne) {
@@ -307,17 +300,19 @@ TEST(PullDownloadSharedIcon, SecondSiteNamingTheSameIconUrlLostItsIcon) {
   DbSession db;
   ItemListGuard guard;
   const std::string catalogue = db.root().dir() + "/catalogue.json";
-  ASSERT_TRUE(write_file(catalogue, R"({"sites": [
-    {"url": "http://first.example/", "name": "First", "color": "#102030", "section": "global",
-     "icons": [{"id": 1, "file": "shared/apple-touch-icon.png", "size": 57, "colorType": "rgb",
-                "bitDepth": 8, "administered": true, "lastModified": "2024-03-01 09:30:00.000"}]},
-    {"url": "http://second.example/", "name": "Second", "color": "#102030", "section": "global",
-     "icons": [{"id": 2, "file": "shared/apple-touch-icon.png", "size": 57, "colorType": "rgb",
-                "bitDepth": 8, "administered": true, "lastModified": "2024-03-01 09:30:00.000"}]},
-    {"url": "http://third.example/", "name": "Third", "color": "#708090", "section": "global",
-     "icons": [{"id": 3, "file": "third/apple-touch-icon.png", "size": 57, "colorType": "rgb",
-                "bitDepth": 8, "administered": true, "lastModified": "2024-03-01 09:30:00.000"}]}
-  ]})"));
+  auto site = [](const char* name, const char* color, int id, const char* file) {
+    return std::string(R"({"url": "http://)") + name + R"(.example/", "name": ")" + name +
+           R"(", "color": ")" + color + R"(", "section": "global", "icons": [{"id": )" +
+           std::to_string(id) + R"(, "file": ")" + file +
+           R"(", "size": 57, "colorType": "rgb", "bitDepth": 8, "administered": true,
+           "lastModified": "2024-03-01 09:30:00.000"}]})";
+  };
+  ASSERT_TRUE(write_file(catalogue, R"({"sites": [)" +
+                                        site("first", "#102030", 1, "shared/apple-touch-icon.png") +
+                                        "," +
+                                        site("second", "#102030", 2, "shared/apple-touch-icon.png") +
+                                        "," + site("third", "#708090", 3, "third/apple-touch-icon.png") +
+                                        "]}"));
   ContentServerProcess content({"--catalogue", catalogue});
   ASSERT_TRUE(content.ok());
   EXPECT_EQ(sds_download_and_parse_json_data(content.signed_url(kQuery).c_str()), SDS_ERROR_NONE);
@@ -344,7 +339,7 @@ TEST_F(PullDownload, IconsThatAreNoUsablePngLeaveOnlyTheirSiteWithoutIcon) {
   EXPECT_EQ(DbSession::rows("SELECT count(*) FROM site_deck WHERE icon_data IS NOT NULL"), "20");
   // Every download completed, so the list counts as stored.
   EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), list_etag() + "\r\n");
-  EXPECT_EQ(images_left(), 0);
+  EXPECT_TRUE(no_images_left());
 }
 
 // Waits up to 20 s for `name` to be created in the watched directory.
@@ -400,9 +395,7 @@ TEST_F(PullDownload, ServiceKilledInTheMiddleOfTheMergeLeavesThePreviousTable) {
   EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), etag);
   EXPECT_EQ(pull(), SDS_ERROR_NONE);
   EXPECT_EQ(stat("last_if_none_match") + "\r\n", etag);
-  EXPECT_EQ(
-      DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) + "'"),
-      "0");
+  EXPECT_EQ(garden_rows(), "0");
   EXPECT_EQ(first_pixel_hex(kHerald), bgra_hex("#39D7D7"));
 }
 

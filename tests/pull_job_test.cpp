@@ -150,15 +150,6 @@ TEST_F(PullJob, PermanentRedirectsWithoutEndStopRewritingTheList) {
             std::string::npos);
 }
 
-TEST_F(PullJob, RedirectWithoutLocationIsAFailedAttempt) {
-  ASSERT_TRUE(a_.control({{"status", "302"}, {"location", ""}}));
-  ASSERT_TRUE(
-      write_server_list({{1, a_.base_url(), 0, 2, false}, {2, b_.base_url(), 0, 1, false}}));
-  EXPECT_EQ(sds_check_data_pull_required(nullptr), SDS_ERROR_NONE);
-  EXPECT_EQ(requests(a_), "2");
-  EXPECT_EQ(requests(b_), "1");
-}
-
 TEST_F(PullJob, FirstEntryWithoutAttemptsEndsThePullUnasked) {
   ASSERT_TRUE(
       write_server_list({{1, a_.base_url(), 0, 0, false}, {2, b_.base_url(), 0, 1, false}}));
