@@ -21,6 +21,14 @@ constexpr const char* kTableSql =
     "DEFAULT 0,sync1 TEXT DEFAULT NULL,sync2 TEXT DEFAULT NULL,sync3 TEXT DEFAULT NULL,sync4 TEXT "
     "DEFAULT NULL)";
 
+// Writes `sql` into the file at `path` through a connection of its own.
+void make_file(const std::string& path, const std::string& sql) {
+  sqlite3* other = nullptr;
+  ASSERT_EQ(sqlite3_open(path.c_str(), &other), SQLITE_OK);
+  EXPECT_EQ(sqlite3_exec(other, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
+  sqlite3_close(other);
+}
+
 TEST(DbOpen, FirstStartCreatesTheTableWithAllColumnsAndDefaults) {
   LogCapture log;
   DbSession db;
@@ -50,15 +58,7 @@ TEST(DbOpen, UrlLookupsScannedTheWholeTable) {
 
 TEST(DbOpen, FileMadeBeforeTheUrlIndexGetsItAndKeepsItsRows) {
   DbSession db(false);
-  sqlite3* other = nullptr;
-  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &other), SQLITE_OK);
-  ASSERT_EQ(
-      sqlite3_exec(other,
-                   (std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')").c_str(),
-                   nullptr, nullptr, nullptr),
-      SQLITE_OK);
-  sqlite3_close(other);
-
+  make_file(db.db_path(), std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')");
   LogCapture log;
   EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
   EXPECT_EQ(db.rows("SELECT name FROM sqlite_master WHERE name = 'site_deck_url_index'"),
@@ -119,13 +119,7 @@ TEST(DbOpen, FileThatIsNoDatabaseIsReplacedByAnEmptyTable) {
 
 TEST(DbOpen, ExistingFileWithoutTheTableIsLeftAsItIs) {
   DbSession db(false);
-  sqlite3* other = nullptr;
-  ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &other), SQLITE_OK);
-  ASSERT_EQ(sqlite3_exec(other, "CREATE TABLE other(x); INSERT INTO other VALUES (7)", nullptr,
-                         nullptr, nullptr),
-            SQLITE_OK);
-  sqlite3_close(other);
-
+  make_file(db.db_path(), "CREATE TABLE other(x); INSERT INTO other VALUES (7)");
   LogCapture log;
   EXPECT_EQ(sds_ensure_db_open(), SDS_ERROR_NONE);
   EXPECT_EQ(__check_table(sds_db_handle, "site_deck"), -1);
@@ -216,13 +210,10 @@ TEST(DbOpen, StoredEtagOutlivedTheItemsSoTheNextPullWasAnsweredNotModified) {
     if (c.setup_sql != nullptr && std::string(c.setup_sql) == "garbage") {
       ASSERT_TRUE(write_file(db.db_path(), std::string(8192, 'g')));
     } else if (c.setup_sql != nullptr) {
-      sqlite3* other = nullptr;
-      ASSERT_EQ(sqlite3_open(db.db_path().c_str(), &other), SQLITE_OK);
-      std::string sql = c.setup_sql[0] != '\0'
-                            ? std::string(c.setup_sql)
-                            : std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')";
-      ASSERT_EQ(sqlite3_exec(other, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
-      sqlite3_close(other);
+      make_file(db.db_path(),
+                c.setup_sql[0] != '\0'
+                    ? std::string(c.setup_sql)
+                    : std::string(kTableSql) + "; INSERT INTO site_deck(url) VALUES ('u')");
     }
     const std::string etag = db.root().path(SDS_ETAG_PATH);
     ASSERT_TRUE(write_file(etag, "\"v1\"\r\n"));

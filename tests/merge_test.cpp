@@ -311,29 +311,20 @@ TEST_F(Merge, MergeCutInHalfIsNeverSeenAndNeverLeftBehind) {
 
 TEST_F(Merge, FailedRowWritesWereCommittedAsIfTheListWasStored) {
   // Triggers make the writes fail as a disk that turned read-only would.
+  const char* const kRow = "a row of the list could not be written";
   const struct {
-    const char* name;
-    const char* trigger;
+    const char* event;
     const char* message;
   } cases[] = {
-      {"insert fails",
-       "CREATE TRIGGER fail BEFORE INSERT ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END",
-       "a row of the list could not be written"},
-      {"renumbering fails",
-       "CREATE TRIGGER fail BEFORE UPDATE OF order_index ON site_deck BEGIN "
-       "SELECT RAISE(ABORT, 'no'); END",
-       "a row of the list could not be written"},
-      {"delete fails",
-       "CREATE TRIGGER fail BEFORE DELETE ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END",
-       "Not able to delete one URL"},
-  };
+      {"INSERT", kRow}, {"UPDATE OF order_index", kRow}, {"DELETE", "Not able to delete one URL"}};
   add_item(kA, "A");
   add_item(kB, "B");
   ASSERT_EQ(merge(), 0);
   const std::string before = db_.rows("SELECT * FROM site_deck ORDER BY id");
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.name);
-    ASSERT_TRUE(db_.exec(c.trigger));
+    SCOPED_TRACE(c.event);
+    ASSERT_TRUE(db_.exec(std::string("CREATE TRIGGER fail BEFORE ") + c.event +
+                         " ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END"));
     add_item(kC, "C");
     add_item(kA, "A");
     LogCapture log;
