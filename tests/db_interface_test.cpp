@@ -130,10 +130,6 @@ TEST_F(DbInterface, ReadsReportNoDataAndUnknownIdsAsErrors) {
   EXPECT_EQ(get_sitedeck_title_from_db(1, &text), SDS_ERROR_NONE);
   EXPECT_STREQ(text, "A");
   std::free(text);
-  EXPECT_EQ(sds_get_string_for_url_from_db("https://a.example/", &text, "icon_path"),
-            SDS_ERROR_NONE);
-  EXPECT_STREQ(text, "https://a.example/old.png");
-  std::free(text);
 }
 
 TEST_F(DbInterface, SingleColumnWrites) {
