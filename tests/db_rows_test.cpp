@@ -7,6 +7,7 @@
 
 #include "database/sitedeck-service-db-interface.h"
 #include "database/sitedeck-service-db.h"
+#include "sitedeck-service-request-server.h"
 #include "support/db_session.h"
 #include "support/items.h"
 #include "support/log_capture.h"
@@ -79,60 +80,42 @@ TEST_F(DbRows, TextReadsTellMissingRowsFromMissingValues) {
   EXPECT_TRUE(log.contains("check connection handle"));
 }
 
-TEST_F(DbRows, IntegerReads) {
+TEST_F(DbRows, IntegerAndBlobReads) {
   ASSERT_TRUE(db_.exec("INSERT INTO site_deck(id, url) VALUES (2, 'b')"));
   sds_db_value value{};
   int code = -5;
-  EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 1, "site_deck", "favicon_exists", &value, &code),
-            0);
-  EXPECT_EQ(code, SDS_ERROR_NONE);
-  EXPECT_EQ(value.i32, 1);
-
-  value = {};
   EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 1, "site_deck", "order_index", &value, &code),
             0);
-  EXPECT_EQ(value.i64, 2);  // a REAL arrives converted over all eight bytes
-
-  LogCapture log;
-  value = {};
-  value.i32 = 77;
-  EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 99, "site_deck", "is_dirty", &value, &code), 0);
-  EXPECT_EQ(code, SDS_ERROR_NO_DATA);
-  EXPECT_EQ(sds_db_get_property_int(sds_db_handle, 2, "site_deck", "title", &value, &code), 0);
-  EXPECT_EQ(code, SDS_ERROR_NO_DATA);
-  EXPECT_TRUE(log.contains("check column type:5"));
-  EXPECT_EQ(value.i32, 77);
-}
-
-TEST_F(DbRows, BlobReads) {
-  ASSERT_TRUE(db_.exec("INSERT INTO site_deck(id, url) VALUES (2, 'b')"));
-  unsigned char* bytes = nullptr;
-  int size = 99;
-  int code = -5;
-  EXPECT_EQ(
-      sds_db_get_property_blob(sds_db_handle, 1, "site_deck", "icon_data", &bytes, &size, &code),
-      0);
   EXPECT_EQ(code, SDS_ERROR_NONE);
-  ASSERT_EQ(size, 2);
-  EXPECT_EQ(bytes[0], 1);
-  EXPECT_EQ(bytes[1], 2);
-  std::free(bytes);
+  EXPECT_EQ(value.i64, 2);  // a REAL arrives converted over all eight bytes
+  LogCapture log;
+  value.i64 = 77;
+  for (auto [id, column] : {std::pair{99, "is_dirty"}, std::pair{2, "title"}}) {
+    EXPECT_EQ(sds_db_get_property_int(sds_db_handle, id, "site_deck", column, &value, &code), 0);
+    EXPECT_EQ(code, SDS_ERROR_NO_DATA);
+  }
+  EXPECT_EQ(log.count("check column type:5"), 1);
+  EXPECT_EQ(value.i64, 77);
 
-  bytes = nullptr;
-  size = 99;
-  EXPECT_EQ(
-      sds_db_get_property_blob(sds_db_handle, 2, "site_deck", "icon_data", &bytes, &size, &code),
-      0);
-  EXPECT_EQ(code, SDS_ERROR_NO_DATA);
-  EXPECT_EQ(size, 0);
-  EXPECT_EQ(bytes, nullptr);
-
-  size = 99;
-  EXPECT_EQ(
-      sds_db_get_property_blob(sds_db_handle, 9, "site_deck", "icon_data", &bytes, &size, &code),
-      -1);
-  EXPECT_EQ(code, SDS_ERROR_ID_NOT_FOUND);
-  EXPECT_EQ(size, 0);
+  const struct {
+    int id, result, code;
+    std::string bytes;
+  } blobs[] = {{1, 0, SDS_ERROR_NONE, "\x01\x02"},
+               {2, 0, SDS_ERROR_NO_DATA, ""},
+               {9, -1, SDS_ERROR_ID_NOT_FOUND, ""}};
+  for (const auto& c : blobs) {
+    SCOPED_TRACE(c.id);
+    unsigned char* bytes = nullptr;
+    int size = 99;
+    EXPECT_EQ(sds_db_get_property_blob(sds_db_handle, c.id, "site_deck", "icon_data", &bytes, &size,
+                                       &code),
+              c.result);
+    EXPECT_EQ(code, c.code);
+    ASSERT_EQ(size, int(c.bytes.size()));
+    EXPECT_EQ(bytes == nullptr, c.bytes.empty());
+    EXPECT_EQ(bytes ? std::string(reinterpret_cast<char*>(bytes), size) : "", c.bytes);
+    std::free(bytes);
+  }
 }
 
 TEST_F(DbRows, TextReadByUrl) {
@@ -145,18 +128,22 @@ TEST_F(DbRows, TextReadByUrl) {
   EXPECT_STREQ(value, "96x64");
   std::free(value);
   value = kUntouched;
-  EXPECT_EQ(sds_db_get_property_string_for_url(sds_db_handle, "https://other/", "site_deck",
-                                               "icon_size", &value, &code),
-            -1);
-  EXPECT_EQ(code, SDS_ERROR_ID_NOT_FOUND);
   LogCapture log;
-  EXPECT_EQ(
-      sds_db_get_property_string_for_url(sds_db_handle, "", "site_deck", "url", &value, &code), -1);
-  EXPECT_TRUE(log.contains("Url is null or empty"));
-  EXPECT_EQ(
-      sds_db_get_property_string_for_url(sds_db_handle, "u", "site_deck", nullptr, &value, &code),
-      -1);
-  EXPECT_TRUE(log.contains("check materials for query for url = u"));
+  const struct {
+    const char *url, *column;
+    int code;
+    const char* message;
+  } cases[] = {
+      {"https://other/", "icon_size", SDS_ERROR_ID_NOT_FOUND, nullptr},
+      {"", "url", SDS_ERROR_INVALID_PARAMETER, "Url is null or empty"},
+      {"u", nullptr, SDS_ERROR_INVALID_PARAMETER, "check materials for query for url = u"}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.url);
+    EXPECT_EQ(sds_db_get_property_string_for_url(sds_db_handle, c.url, "site_deck", c.column,
+                                                 &value, &code),
+              -1);
+    EXPECT_TRUE(c.message == nullptr || log.contains(c.message));
+  }
   EXPECT_EQ(value, kUntouched);
 }
 
@@ -193,59 +180,20 @@ TEST_F(DbRows, IdListsComeInOrderIndexOrder) {
   EXPECT_EQ(result, -1);
   EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
   EXPECT_TRUE(log.contains("invalid type:7"));
-}
 
-TEST_F(DbRows, IdListOfNoMatchingRowIsNoDataWithOutputsUntouched) {
+  // No matching row: no data, outputs untouched.
   ASSERT_TRUE(db_.exec("UPDATE site_deck SET is_dirty = -1"));
-  int result = -5;
-  int code = 0;
+  result = -5;
   EXPECT_EQ(ids_of(nullptr, nullptr, 0, &result, &code), "<untouched>");
   EXPECT_EQ(result, 0);
   EXPECT_EQ(code, SDS_ERROR_NO_DATA);
 }
 
-TEST_F(DbRows, ColumnReplaceByType) {
-  int code = -5;
-  int small = -1;
-  int64_t big = 5000000000;
-  const unsigned char blob[3] = {9, 0, 9};
-  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "is_dirty", &small, 0,
-                                  SDS_DB_COLUMN_TYPE_INT, &code),
-            0);
-  EXPECT_EQ(code, SDS_ERROR_NONE);
-  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "sync1", &big, 0,
-                                  SDS_DB_COLUMN_TYPE_INT64, &code),
-            0);
-  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "title", "T", 99,
-                                  SDS_DB_COLUMN_TYPE_TEXT, &code),
-            0);
-  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "icon_data", blob, 3,
-                                  SDS_DB_COLUMN_TYPE_BLOB, &code),
-            0);
-  EXPECT_EQ(db_.rows("SELECT is_dirty, sync1, title, hex(icon_data) FROM site_deck"),
-            "-1|5000000000|T|090009");
-}
-
-TEST_F(DbRows, ColumnReplaceRefusals) {
-  std::string before = db_.rows("SELECT * FROM site_deck");
+TEST_F(DbRows, ColumnReplaceOfAnIdWithoutARowUpdatesNothing) {
+  const std::string before = db_.rows("SELECT * FROM site_deck");
   int value = 5;
   int code = -5;
   LogCapture log;
-  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 0, "site_deck", "is_dirty", &value, 0, 0, &code),
-            -1);
-  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
-  EXPECT_TRUE(log.contains("check id:0"));
-  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "is_dirty", nullptr, 0, 0, &code),
-            -1);
-  EXPECT_TRUE(log.contains("check materials for query id:1"));
-  EXPECT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", "is_dirty", &value, 4, 4, &code),
-            -1);
-  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
-  EXPECT_TRUE(log.contains("invalid type:4"));
-  EXPECT_EQ(db_.rows("SELECT * FROM site_deck"), before);
-
-  // An id without a row is a successful update of nothing.
-  log.clear();
   EXPECT_EQ(sds_db_column_replace(sds_db_handle, 42, "site_deck", "is_dirty", &value, 0, 0, &code),
             0);
   EXPECT_EQ(code, SDS_ERROR_NONE);
@@ -253,6 +201,7 @@ TEST_F(DbRows, ColumnReplaceRefusals) {
   EXPECT_EQ(db_.rows("SELECT * FROM site_deck"), before);
 }
 
+// Also the single-column writes of every value type, which must end as the one UPDATE.
 TEST_F(DbRows, SeveralColumnsInOneUpdateEndAsSingleWritesWould) {
   ASSERT_TRUE(db_.exec("INSERT INTO site_deck(id, url) VALUES (2, 'https://a.example/')"));
   int small = -1;
@@ -267,48 +216,39 @@ TEST_F(DbRows, SeveralColumnsInOneUpdateEndAsSingleWritesWould) {
   };
   int code = -5;
   for (const sds_db_column_value& v : values) {
+    code = -5;
     ASSERT_EQ(sds_db_column_replace(sds_db_handle, 1, "site_deck", v.column, v.value, v.length,
                                     v.value_type, &code),
               0);
+    EXPECT_EQ(code, SDS_ERROR_NONE);
   }
   LogCapture log;
   EXPECT_EQ(sds_db_columns_replace(sds_db_handle, 2, "site_deck", values, 5, &code), 0);
   EXPECT_EQ(code, SDS_ERROR_NONE);
   EXPECT_EQ(log.count("Before write finalize, sqlite response code 101"), 1);
   const std::string columns = "is_dirty, sync1, title, hex(icon_data), icon_size, order_index";
-  EXPECT_EQ(db_.rows("SELECT " + columns + " FROM site_deck WHERE id = 2"),
-            "-1|5000000000|Later|090009|NULL|0");
-  EXPECT_EQ(db_.rows("SELECT " + columns + " FROM site_deck WHERE id = 1"),
-            "-1|5000000000|Later|090009|96x64|2.5");
+  EXPECT_EQ(db_.rows("SELECT " + columns + " FROM site_deck ORDER BY id DESC"),
+            "-1|5000000000|Later|090009|NULL|0\n-1|5000000000|Later|090009|96x64|2.5");
 }
 
+// Each refusal also for the single-column write.
 TEST_F(DbRows, SeveralColumnsRefusedWriteNone) {
   const std::string before = db_.rows("SELECT * FROM site_deck");
   int value = 5;
-  struct Case {
-    const char* name;
+  const char* const kMaterials = "check materials for query id:1";
+  const struct {
     int id;
     sds_db_column_value second;
     const char* message;
+  } cases[] = {
+      {0, {"title", "T", 0, SDS_DB_COLUMN_TYPE_TEXT}, "check id:0"},
+      {1, {"title", nullptr, 0, SDS_DB_COLUMN_TYPE_TEXT}, kMaterials},
+      {1, {nullptr, "T", 0, SDS_DB_COLUMN_TYPE_TEXT}, kMaterials},
+      {1, {"title", "T", 0, 9}, "invalid type:9"},
+      {1, {"icon_data", "T", -1, SDS_DB_COLUMN_TYPE_BLOB}, kMaterials},  // negative blob length
   };
-  const Case cases[] = {
-      {"id 0", 0, {"title", "T", 0, SDS_DB_COLUMN_TYPE_TEXT}, "check id:0"},
-      {"null value",
-       1,
-       {"title", nullptr, 0, SDS_DB_COLUMN_TYPE_TEXT},
-       "check materials for query id:1"},
-      {"null column",
-       1,
-       {nullptr, "T", 0, SDS_DB_COLUMN_TYPE_TEXT},
-       "check materials for query id:1"},
-      {"unknown type", 1, {"title", "T", 0, 9}, "invalid type:9"},
-      {"negative blob length",
-       1,
-       {"icon_data", "T", -1, SDS_DB_COLUMN_TYPE_BLOB},
-       "check materials for query id:1"},
-  };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.name);
+  for (const auto& c : cases) {
+    SCOPED_TRACE(&c - cases);
     const sds_db_column_value values[] = {{"is_dirty", &value, 0, SDS_DB_COLUMN_TYPE_INT},
                                           c.second};
     LogCapture log;
@@ -316,6 +256,15 @@ TEST_F(DbRows, SeveralColumnsRefusedWriteNone) {
     EXPECT_EQ(sds_db_columns_replace(sds_db_handle, c.id, "site_deck", values, 2, &code), -1);
     EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
     EXPECT_TRUE(log.contains(c.message));
+    // The same column alone, through the single-column write.
+    LogCapture single_log;
+    code = -5;
+    const sds_db_column_value& v = c.second;
+    EXPECT_EQ(sds_db_column_replace(sds_db_handle, c.id, "site_deck", v.column, v.value, v.length,
+                                    v.value_type, &code),
+              -1);
+    EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+    EXPECT_TRUE(single_log.contains(c.message));
     EXPECT_EQ(db_.rows("SELECT * FROM site_deck"), before);
   }
   int code = -5;
@@ -341,19 +290,25 @@ TEST_F(DbRows, DeleteOfUrlWithQuoteDeletesExactlyThatRow) {
 }
 
 TEST_F(DbRows, DuplicateChecks) {
-  int code = -5;
-  EXPECT_EQ(sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", "https://a.example/",
-                                           &code),
-            1);
-  EXPECT_EQ(code, SDS_ERROR_NONE);
-  EXPECT_EQ(sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", "unknown", &code),
-            -1);
-  EXPECT_EQ(code, SDS_ERROR_NONE);
-  EXPECT_EQ(sds_db_check_duplicated_int(sds_db_handle, "site_deck", "favicon_exists", 1, &code), 1);
-  EXPECT_EQ(sds_db_check_duplicated_int(sds_db_handle, "site_deck", "favicon_exists", 0, &code), 0);
-  EXPECT_EQ(code, SDS_ERROR_NONE);
-  EXPECT_EQ(sds_db_check_duplicated_string(sds_db_handle, "site_deck", "nothing", "u", &code), -1);
-  EXPECT_EQ(code, SDS_ERROR_INVALID_PARAMETER);
+  const struct {
+    const char* column;
+    const char* text;  // null: the integer check with `number`
+    int number, result, code;
+  } cases[] = {{"url", "https://a.example/", 0, 1, SDS_ERROR_NONE},
+               {"url", "unknown", 0, -1, SDS_ERROR_NONE},
+               {"favicon_exists", nullptr, 1, 1, SDS_ERROR_NONE},
+               {"favicon_exists", nullptr, 0, 0, SDS_ERROR_NONE},
+               {"nothing", "u", 0, -1, SDS_ERROR_INVALID_PARAMETER}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(&c - cases);
+    int code = -5;
+    EXPECT_EQ(
+        c.text != nullptr
+            ? sds_db_check_duplicated_string(sds_db_handle, "site_deck", c.column, c.text, &code)
+            : sds_db_check_duplicated_int(sds_db_handle, "site_deck", c.column, c.number, &code),
+        c.result);
+    EXPECT_EQ(code, c.code);
+  }
 }
 
 TEST_F(DbRows, InsertOfItems) {
@@ -363,14 +318,14 @@ TEST_F(DbRows, InsertOfItems) {
   sds_item* full = add_item("https://c.example/", "C", "#112233");
   add_icon(full, "https://c.example/i.png", "192x192", "2024-01-01");
   add_icon(full, "https://c.example/j.png", "64", "other");
-  sds_item* pathless = add_item(nullptr, "no url");
-  add_icon(pathless, nullptr, "1x1", "t");
+  add_icon(add_item(nullptr, "no url"), nullptr, "1x1", "t");
 
   int code = -5;
-  EXPECT_EQ(sds_db_create_site_deck_item(sds_db_handle, bare, &code), 2);
-  EXPECT_EQ(code, SDS_ERROR_NONE);
-  EXPECT_EQ(sds_db_create_site_deck_item(sds_db_handle, full, &code), 3);
-  EXPECT_EQ(sds_db_create_site_deck_item(sds_db_handle, pathless, &code), 4);
+  int expected_id = 2;
+  for (sds_item* item = sds_item_list_head; item != nullptr; item = item->next) {
+    EXPECT_EQ(sds_db_create_site_deck_item(sds_db_handle, item, &code), expected_id++);
+    EXPECT_EQ(code, SDS_ERROR_NONE);
+  }
   EXPECT_EQ(db_.rows("SELECT id, url, title, favicon_exists, dominant_color, touch_icon_exists, "
                      "icon_size, image_last_updated, icon_path, is_dirty, order_index, icon_data "
                      "FROM site_deck WHERE id > 1"),

@@ -9,6 +9,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "database/sitedeck-service-db-interface.h"
 #include "sitedeck-service-raii.h"
@@ -46,17 +47,53 @@ class Merge : public ::testing::Test {
   ItemListGuard guard_;
 };
 
-TEST_F(Merge, FirstMergeNumbersSitesInListOrder) {
-  add_item(kC, "C", "#333333");
-  add_item(kA, nullptr, nullptr);
-  add_item(kB, "", "#222222");
-  LogCapture log;
-  EXPECT_EQ(merge(), 0);
-  EXPECT_EQ(table(),
-            "https://a.example/|https://a.example/||1|2\n"
-            "https://b.example/|https://b.example/|#222222|1|3\n"
-            "https://c.example/|C|#333333|1|1");
-  EXPECT_FALSE(log.contains("Not able to delete one URL"));
+struct Listed {
+  const char* url;
+  const char* title = nullptr;
+  const char* colour = nullptr;
+  int removed = 0;
+};
+
+// Each case merges its lists one after another into an empty table; after each
+// merge the table reads as given.
+TEST_F(Merge, ListsEndAsTheirTables) {
+  struct Step {
+    std::vector<Listed> list;
+    const char* table;
+  };
+  const char* const kRemovedB = "https://a.example/|A||1|1\nhttps://b.example/|B||-1|2";
+  const struct {
+    const char* name;
+    std::vector<Step> steps;
+  } cases[] = {
+      {"first merge numbers sites in list order; no title is the URL",
+       {{{{kC, "C", "#333333"}, {kA}, {kB, "", "#222222"}},
+         "https://a.example/|https://a.example/||1|2\n"
+         "https://b.example/|https://b.example/|#222222|1|3\n"
+         "https://c.example/|C|#333333|1|1"}}},
+      {"specially removed site is kept, also when gone from the list, and comes back",
+       {{{{kA, "A"}, {kB, "B"}}, "https://a.example/|A||1|1\nhttps://b.example/|B||1|2"},
+        {{{kA, "A"}, {kB, "B", nullptr, 1}}, kRemovedB},
+        {{{kA, "A"}}, kRemovedB},
+        {{{kB, "B"}, {kA, "A"}}, "https://a.example/|A||1|2\nhttps://b.example/|B||1|1"}}},
+      {"items without URL take no number",
+       {{{{nullptr, "no url"}, {kA, "A"}, {"", "empty url"}, {kB, "B"}},
+         "https://a.example/|A||1|1\nhttps://b.example/|B||1|2"}}},
+      {"a duplicate URL leaves one row with the second occurrence",
+       {{{{kA, "A1", "#111111"}, {kB, "B"}, {kA, "A2", "#999999"}},
+         "https://a.example/|A2|#999999|1|3\nhttps://b.example/|B||1|2"}}},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    ASSERT_TRUE(db_.exec("DELETE FROM site_deck"));
+    for (const Step& step : c.steps) {
+      for (const Listed& l : step.list) add_item(l.url, l.title, l.colour, l.removed);
+      LogCapture log;
+      EXPECT_EQ(merge(), 0);
+      EXPECT_EQ(table(), step.table);
+      EXPECT_FALSE(log.contains("Not able to delete one URL"));
+    }
+  }
 }
 
 TEST_F(Merge, RefreshReordersAndDeletesVanishedLiveSites) {
@@ -70,61 +107,11 @@ TEST_F(Merge, RefreshReordersAndDeletesVanishedLiveSites) {
   a->fav_icon_exists = 0;
   a->touch_icons_exists = 1;
   EXPECT_EQ(merge(), 0);
-  EXPECT_EQ(table(),
-            "https://a.example/|A2|#999999|1|2\n"
-            "https://c.example/|C2|#333333|1|1");
+  EXPECT_EQ(table(), "https://a.example/|A2|#999999|1|2\nhttps://c.example/|C2|#333333|1|1");
   // The flags of a stored row keep the values of its first insert.
   EXPECT_EQ(db_.rows("SELECT favicon_exists, touch_icon_exists FROM site_deck WHERE url = '" +
                      std::string(kA) + "'"),
             "1|0");
-}
-
-TEST_F(Merge, SpeciallyRemovedSiteIsKeptAndComesBack) {
-  add_item(kA, "A");
-  add_item(kB, "B");
-  ASSERT_EQ(merge(), 0);
-
-  add_item(kA, "A");
-  add_item(kB, "B", nullptr, 1);
-  EXPECT_EQ(merge(), 0);
-  EXPECT_EQ(table(),
-            "https://a.example/|A||1|1\n"
-            "https://b.example/|B||-1|2");
-
-  // Gone from the list, but not live: the clean-up leaves it.
-  add_item(kA, "A");
-  EXPECT_EQ(merge(), 0);
-  EXPECT_EQ(table(),
-            "https://a.example/|A||1|1\n"
-            "https://b.example/|B||-1|2");
-
-  add_item(kB, "B");
-  add_item(kA, "A");
-  EXPECT_EQ(merge(), 0);
-  EXPECT_EQ(table(),
-            "https://a.example/|A||1|2\n"
-            "https://b.example/|B||1|1");
-}
-
-TEST_F(Merge, ItemsWithoutUrlTakeNoNumber) {
-  add_item(nullptr, "no url");
-  add_item(kA, "A");
-  add_item("", "empty url");
-  add_item(kB, "B");
-  EXPECT_EQ(merge(), 0);
-  EXPECT_EQ(table(),
-            "https://a.example/|A||1|1\n"
-            "https://b.example/|B||1|2");
-}
-
-TEST_F(Merge, DuplicateUrlLeavesOneRowWithTheSecondOccurrence) {
-  add_item(kA, "A1", "#111111");
-  add_item(kB, "B");
-  add_item(kA, "A2", "#999999");
-  EXPECT_EQ(merge(), 0);
-  EXPECT_EQ(table(),
-            "https://a.example/|A2|#999999|1|3\n"
-            "https://b.example/|B||1|2");
 }
 
 TEST_F(Merge, AllSpeciallyRemovedEndsWithMinusOneAfterStoringTheFlags) {
@@ -172,25 +159,22 @@ TEST_F(Merge, ItemsWrittenInOneUpdateEndAsWithTheSingleColumnWrites) {
     add_item(kC, "C", "#CCCCCC");
   };
   auto write_icons = [] {
-    for (const char* url : {"https://a.example/new.png", "https://b.example/i.png"}) {
-      UniqueCStr path(get_icon_path(url));
-      bool a = std::strcmp(url, "https://a.example/new.png") == 0;
-      if (!path || !png_write_file(path.get(), png_pattern(a ? 2 : 3, 2, a ? 2 : 6, 8))) {
-        return false;
-      }
-    }
-    return true;
+    UniqueCStr a(get_icon_path("https://a.example/new.png"));
+    UniqueCStr b(get_icon_path("https://b.example/i.png"));
+    return png_write_file(a.get(), png_pattern(2, 2, 2, 8)) &&
+           png_write_file(b.get(), png_pattern(3, 2, 6, 8));
   };
 
-  ASSERT_TRUE(db_.exec(seed));
-  build_list();
-  ASSERT_TRUE(write_icons());
-  ASSERT_EQ(merge(), 0);
-  const std::string merged = db_.rows(dump);
-
-  ASSERT_TRUE(db_.exec(seed));
-  build_list();
-  ASSERT_TRUE(write_icons());
+  std::string merged;
+  for (bool by_merge : {true, false}) {
+    ASSERT_TRUE(db_.exec(seed));
+    build_list();
+    ASSERT_TRUE(write_icons());
+    if (by_merge) {
+      ASSERT_EQ(merge(), 0);
+      merged = db_.rows(dump);
+    }
+  }
   int order = 1;
   for (sds_item* item = sds_item_list_head; item != nullptr; item = item->next, ++order) {
     if (item->site_name == nullptr) item->site_name = strdup(item->site_url);
@@ -246,23 +230,6 @@ int deny_order_index(void*, int action, const char*, const char* column, const c
     return SQLITE_DENY;
   }
   return SQLITE_OK;
-}
-
-TEST_F(Merge, MergeWhoseCleanupFailsLeavesThePreviousTableWhole) {
-  add_item(kA, "A");
-  add_item(kB, "B");
-  ASSERT_EQ(merge(), 0);
-  std::string before = db_.rows("SELECT * FROM site_deck ORDER BY id");
-
-  add_item(kC, "C");
-  add_item(kB, "B2");
-  add_item(kD, "D", nullptr, 1);
-  sqlite3_set_authorizer(sds_db_handle, deny_order_index, nullptr);
-  LogCapture log;
-  EXPECT_EQ(merge(), SDS_MERGE_NOT_COMMITTED);
-  sqlite3_set_authorizer(sds_db_handle, nullptr, nullptr);
-  EXPECT_TRUE(log.contains("Error : 5"));
-  EXPECT_EQ(db_.rows("SELECT * FROM site_deck ORDER BY id"), before);
 }
 
 struct PauseState {
@@ -325,41 +292,33 @@ TEST_F(Merge, MergeCutInHalfIsNeverSeenAndNeverLeftBehind) {
   EXPECT_EQ(db_.rows(dump), before);
 }
 
-}  // namespace
-
-namespace {
-
 TEST_F(Merge, FailedRowWritesWereCommittedAsIfTheListWasStored) {
-  // Triggers make the writes fail as a disk that turned read-only would.
+  // Triggers make the writes fail as a disk that turned read-only would; with
+  // no event, the clean-up's id list cannot be read: the previous table stays whole.
+  const char* const kRow = "a row of the list could not be written";
   const struct {
-    const char* name;
-    const char* trigger;
+    const char* event;
     const char* message;
-  } cases[] = {
-      {"insert fails",
-       "CREATE TRIGGER fail BEFORE INSERT ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END",
-       "a row of the list could not be written"},
-      {"renumbering fails",
-       "CREATE TRIGGER fail BEFORE UPDATE OF order_index ON site_deck BEGIN "
-       "SELECT RAISE(ABORT, 'no'); END",
-       "a row of the list could not be written"},
-      {"delete fails",
-       "CREATE TRIGGER fail BEFORE DELETE ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END",
-       "Not able to delete one URL"},
-  };
+  } cases[] = {{"INSERT", kRow},
+               {"UPDATE OF order_index", kRow},
+               {"DELETE", "Not able to delete one URL"},
+               {nullptr, "Error : 5"}};
   add_item(kA, "A");
   add_item(kB, "B");
   ASSERT_EQ(merge(), 0);
   const std::string before = db_.rows("SELECT * FROM site_deck ORDER BY id");
   for (const auto& c : cases) {
-    SCOPED_TRACE(c.name);
-    ASSERT_TRUE(db_.exec(c.trigger));
+    SCOPED_TRACE(c.event ? c.event : "clean-up");
+    ASSERT_TRUE(c.event ? db_.exec(std::string("CREATE TRIGGER fail BEFORE ") + c.event +
+                                   " ON site_deck BEGIN SELECT RAISE(ABORT, 'no'); END")
+                        : sqlite3_set_authorizer(sds_db_handle, deny_order_index, nullptr) == 0);
     add_item(kC, "C");
     add_item(kA, "A");
     LogCapture log;
     EXPECT_EQ(merge(), SDS_MERGE_NOT_COMMITTED);
     EXPECT_TRUE(log.contains(c.message));
-    ASSERT_TRUE(db_.exec("DROP TRIGGER fail"));
+    sqlite3_set_authorizer(sds_db_handle, nullptr, nullptr);
+    ASSERT_TRUE(!c.event || db_.exec("DROP TRIGGER fail"));
     EXPECT_EQ(db_.rows("SELECT * FROM site_deck ORDER BY id"), before);
   }
 }
