@@ -98,6 +98,7 @@ class ServingReplies : public ::testing::Test {
   }
   // Serves command 7 for item 1 and reads a reply of `words` 32-bit items.
   std::vector<int32_t> icon_reply(size_t words = 4) {
+    (void)_sds_get_blob(pair_.service.get(), 1);
     return read_reply(words);
   }
   // Reads one reply of `words` 32-bit items from the peer's end.
