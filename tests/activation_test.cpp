@@ -1,7 +1,6 @@
 // The real service binary, started the ways a device starts it: under the
 // activator, with a socket handed over directly, or without activation.
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -57,17 +56,6 @@ TEST_F(Activation, WithoutActivationTheServiceExitsWithOneAndCreatesNoSocket) {
   EXPECT_EQ(exit_code(service), 1);
   EXPECT_TRUE(service.has_message("[CRITICAL]  Failed to get the socket")) << service.output();
   EXPECT_FALSE(file_exists(root_.path(SDS_SOCKET_PATH)));
-}
-
-TEST_F(Activation, ClientGetsTheHandshakeAndItsCloseEndsTheServiceWithStatusZero) {
-  connect_activated();
-  EXPECT_GT(connection_.cid(), 0);
-  struct stat st {};
-  ASSERT_EQ(stat(SDS_SHM_FILE_PATH, &st), 0);
-  EXPECT_EQ(static_cast<size_t>(st.st_size), SDS_SHM_SIZE);
-  connection_.close();
-  EXPECT_EQ(exit_code(*service_), 0) << service_->output();
-  EXPECT_TRUE(service_->has_message_matching(R"(disconnect client:-1 sock:\d+)"));
 }
 
 // Command 12 gets no reply: the next header (command 0, or one of the cases)
