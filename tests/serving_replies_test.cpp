@@ -14,7 +14,6 @@
 #include <string>
 #include <vector>
 
-#include "database/sitedeck-service-db-interface.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-request-handler-internal.h"
