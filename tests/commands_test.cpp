@@ -111,10 +111,6 @@ class DeckCommands : public ::testing::Test {
  protected:
   void SetUp() override {
     ASSERT_TRUE(seed_deck(base_deck()));
-    start();
-  }
-
-  void start() {
     ASSERT_TRUE(service_.start_activated());
     ASSERT_EQ(service_.connect(&connection_), SDS_ERROR_NONE) << service_.output();
     fd_ = connection_.fd();
