@@ -26,16 +26,17 @@ namespace {
 constexpr int kBoundMs = 10000;
 constexpr int32_t kClientId = 77;
 
-// Reads exactly `length` bytes within the bound and appends them to `out`.
-bool read_into(int fd, size_t length, std::string* out) {
-  while (length > 0) {
+// Appends exactly `length` bytes read within the bound to `out`; with
+// `until_end`, everything until the stream ends instead.
+bool read_into(int fd, size_t length, std::string* out, bool until_end = false) {
+  while (until_end || length > 0) {
     struct pollfd entry = {fd, POLLIN, 0};
     if (poll(&entry, 1, kBoundMs) != 1) return false;
     char buffer[256];
-    ssize_t n = read(fd, buffer, std::min(length, sizeof buffer));
-    if (n <= 0) return false;
+    ssize_t n = read(fd, buffer, until_end ? sizeof buffer : std::min(length, sizeof buffer));
+    if (n <= 0) return until_end;
     out->append(buffer, static_cast<size_t>(n));
-    length -= static_cast<size_t>(n);
+    length -= until_end ? 0 : static_cast<size_t>(n);
   }
   return true;
 }
@@ -43,14 +44,7 @@ bool read_into(int fd, size_t length, std::string* out) {
 // Everything the client sends until it closes (bounded).
 std::string read_until_end(int fd) {
   std::string out;
-  for (;;) {
-    struct pollfd entry = {fd, POLLIN, 0};
-    if (poll(&entry, 1, kBoundMs) != 1) return out + "<no end>";
-    char buffer[256];
-    ssize_t n = read(fd, buffer, sizeof buffer);
-    if (n <= 0) return out;
-    out.append(buffer, static_cast<size_t>(n));
-  }
+  return read_into(fd, 0, &out, true) ? out : out + "<no end>";
 }
 
 template <typename... Words>

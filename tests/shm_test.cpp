@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <fstream>
 #include <string>
 
 #include "sitedeck-service-paths.h"
@@ -50,14 +51,7 @@ TEST_F(ShmTest, CreatingTwiceGivesTheFullSizeWithOpenPermissions) {
   EXPECT_EQ(st.st_gid, app_exists ? group->gr_gid : getegid());
 }
 
-// Reads or sets a kernel switch under /proc/sys; false when it can't.
-bool read_sysctl(const char* path, std::string* value) {
-  UniqueFd fd(open(path, O_RDONLY));
-  char text[16] = {};
-  if (!fd || read(fd.get(), text, sizeof text - 1) <= 0) return false;
-  *value = text;
-  return true;
-}
+// Sets a kernel switch under /proc/sys; false when it can't.
 bool write_sysctl(const char* path, const std::string& value) {
   UniqueFd fd(open(path, O_WRONLY));
   return fd && write(fd.get(), value.data(), value.size()) == static_cast<ssize_t>(value.size());
@@ -70,7 +64,7 @@ TEST_F(ShmTest, ObjectOwnedByAnotherAccountIsReopenedUnderProtectedRegular) {
   constexpr const char* kSwitch = "/proc/sys/fs/protected_regular";
   const struct passwd* other = getpwnam("nobody");
   std::string before;
-  if (geteuid() != 0 || other == nullptr || !read_sysctl(kSwitch, &before)) {
+  if (geteuid() != 0 || other == nullptr || !(std::ifstream(kSwitch) >> before)) {
     GTEST_SKIP() << "needs root, the account nobody and " << kSwitch;
   }
   if (!write_sysctl(kSwitch, "1")) GTEST_SKIP() << kSwitch << " can't be set here";
