@@ -59,7 +59,7 @@ class DescriptorThree {
   bool placed_ = false;
 };
 
-TEST(ActivationProtocol, ListenFdsCountsLikeLibsystemd) {
+TEST(ActivationProtocol, ListenFdsCountsLikeLibsystemdAndKeepsTheVariablesWhenAsked) {
   DescriptorThree three;
   ASSERT_TRUE(three.placed());
   const std::string self = std::to_string(getpid());
@@ -100,11 +100,7 @@ TEST(ActivationProtocol, ListenFdsCountsLikeLibsystemd) {
       EXPECT_EQ(std::getenv("LISTEN_FDNAMES"), nullptr) << c.name << " " << who;
     }
   }
-}
-
-TEST(ActivationProtocol, ListenFdsKeepsTheVariablesWhenAsked) {
-  DescriptorThree three;
-  ASSERT_TRUE(three.placed());
+  // Asked to keep the variables, it keeps them.
   ASSERT_EQ(setenv("LISTEN_PID", std::to_string(getpid()).c_str(), 1), 0);
   ASSERT_EQ(setenv("LISTEN_FDS", "1", 1), 0);
   EXPECT_EQ(sds_listen_fds(0), 1);

@@ -10,6 +10,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <string>
@@ -110,10 +111,6 @@ class DeckCommands : public ::testing::Test {
  protected:
   void SetUp() override {
     ASSERT_TRUE(seed_deck(base_deck()));
-    start();
-  }
-
-  void start() {
     ASSERT_TRUE(service_.start_activated());
     ASSERT_EQ(service_.connect(&connection_), SDS_ERROR_NONE) << service_.output();
     fd_ = connection_.fd();
@@ -183,22 +180,35 @@ TEST_F(DeckCommands, TextAndFlagQueriesAnswerTheStoredValues) {
   EXPECT_TRUE(connection_.is_open());
 }
 
-TEST_F(DeckCommands, UrlReplyIsStatusLengthAndBytesOnTheWire) {
-  send_header(SDS_CMD_GET_URL, 1);
-  const std::string url = "https://one.example/";
-  EXPECT_EQ(read_words(fd_, 2), (std::vector<int32_t>{0, static_cast<int32_t>(url.size())}));
-  std::string text(url.size(), '\0');
-  ASSERT_TRUE(read_bytes(fd_, text.data(), text.size()));
-  EXPECT_EQ(text, url);
-  expect_nothing_pending();
-}
-
-TEST_F(DeckCommands, FlagReplyIsStatusAndOneWordOnTheWire) {
-  send_header(SDS_CMD_GET_TOUCH_ICON_EXISTS, 3);
-  EXPECT_EQ(read_words(fd_, 2), (std::vector<int32_t>{0, 1}));
-  send_header(SDS_CMD_GET_DOMINANT_COLOR, 3);  // NULL: the status alone
-  EXPECT_EQ(read_words(fd_, 1), std::vector<int32_t>{SDS_ERROR_NO_DATA});
-  expect_nothing_pending();
+// Raw replies: exactly these words (and string bytes), then nothing pending.
+TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
+  const std::string flag6 = std::string("\x06\0\0\0", 4);
+  struct Case {
+    const char* name;
+    int32_t cmd, id;
+    std::string sent_after;  // bytes following the header
+    std::vector<int32_t> words;
+    std::string text;
+  } cases[] = {
+      {"url: status, length, bytes", SDS_CMD_GET_URL, 1, "", {0, 20}, "https://one.example/"},
+      {"flag: status and one word", SDS_CMD_GET_TOUCH_ICON_EXISTS, 3, "", {0, 1}, ""},
+      {"NULL text: status alone", SDS_CMD_GET_DOMINANT_COLOR, 3, "", {SDS_ERROR_NO_DATA}, ""},
+      {"icon without pixels: status six alone", SDS_CMD_GET_ICON, 2, "", {SDS_ERROR_NO_DATA}, ""},
+      {"url over the wire limit: status zero, no string", SDS_CMD_GET_URL, 4, "", {0}, ""},
+      {"no condition: live ids in order", SDS_CMD_GET_FULL_IDS, 0, flag6, {0, 3, 2, 1, 5}, ""},
+      {"unknown selector: status five alone", SDS_CMD_GET_FULL_IDS, 0,
+       std::string("\0\0\0\0\x02\0", 6), {SDS_ERROR_INVALID_PARAMETER}, ""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    send_header(c.cmd, c.id);
+    ASSERT_TRUE(write_all(fd_, c.sent_after.data(), c.sent_after.size()));
+    EXPECT_EQ(read_words(fd_, c.words.size()), c.words);
+    std::string text(c.text.size(), '\0');
+    ASSERT_TRUE(read_bytes(fd_, text.data(), text.size()));
+    EXPECT_EQ(text, c.text);
+    expect_nothing_pending();
+  }
 }
 
 TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
@@ -210,11 +220,13 @@ TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
 
   sds_client_icon icon;
   ASSERT_EQ(sds_client_get_icon(connection_, 1, &icon), SDS_ERROR_NONE);
-  EXPECT_EQ(icon.byte_count, static_cast<int32_t>(pixels.size()));
   EXPECT_EQ(icon.width, kIconWidth);
   EXPECT_EQ(icon.height, kIconHeight);
   ASSERT_TRUE(icon.pixels);
   EXPECT_EQ(std::vector<uint8_t>(icon.pixels.get(), icon.pixels.get() + icon.byte_count), pixels);
+  sds_client_icon none;
+  EXPECT_EQ(sds_client_get_icon(connection_, 99, &none), SDS_ERROR_NO_DATA);
+  EXPECT_FALSE(none.pixels);
 }
 
 // The client keeps its mapping between icons. When another party removes the
@@ -242,15 +254,6 @@ TEST_F(DeckCommands, IconIsReadFromTheObjectNowBehindTheName) {
   ASSERT_EQ(sds_client_get_icon(connection_, 1, &second), SDS_ERROR_NONE);
   EXPECT_EQ(std::vector<uint8_t>(second.pixels.get(), second.pixels.get() + second.byte_count),
             pixels);
-}
-
-TEST_F(DeckCommands, IconOfAnItemWithoutPixelsIsStatusSixAlone) {
-  send_header(SDS_CMD_GET_ICON, 2);
-  EXPECT_EQ(read_words(fd_, 1), std::vector<int32_t>{SDS_ERROR_NO_DATA});
-  expect_nothing_pending();
-  sds_client_icon icon;
-  EXPECT_EQ(sds_client_get_icon(connection_, 99, &icon), SDS_ERROR_NO_DATA);
-  EXPECT_FALSE(icon.pixels);
 }
 
 TEST_F(DeckCommands, IconLargerThanTheSharedMemoryIsStatusTwoAndNothingIsCopied) {
@@ -291,7 +294,10 @@ TEST_F(DeckCommands, ReleaseWhenTheObjectIsAlreadyGoneIsStatusTwoAndTheConnectio
 
 TEST_F(DeckCommands, NextUpdateDurationFollowsTheFile) {
   const std::string path = root_.path(SDS_NEXT_UPDATE_DURATION_PATH);
-  const std::string warning = "Next update duration is <= zero ?";
+  const auto warnings = [this] {
+    const auto m = service_.messages();
+    return std::count(m.begin(), m.end(), "Next update duration is <= zero ?");
+  };
   struct Case {
     const char* name;
     const char* content;  // null: no file
@@ -307,13 +313,10 @@ TEST_F(DeckCommands, NextUpdateDurationFollowsTheFile) {
     if (c.content != nullptr) {
       ASSERT_TRUE(write_file(path, c.content)) << c.name;
     }
-    size_t warnings_before = 0;
-    for (const auto& m : service_.messages()) warnings_before += m == warning;
+    const auto before = warnings();
     send_header(SDS_CMD_GET_NEXT_UPDATE_DURATION, 0);
     EXPECT_EQ(read_words(fd_, 2), (std::vector<int32_t>{0, c.seconds})) << c.name;
-    size_t warnings_after = 0;
-    for (const auto& m : service_.messages()) warnings_after += m == warning;
-    EXPECT_EQ(warnings_after - warnings_before, c.warned ? 1u : 0u) << c.name;
+    EXPECT_EQ(warnings() - before, c.warned ? 1 : 0) << c.name;
   }
   int32_t seconds = 0;
   EXPECT_EQ(sds_client_get_next_update_duration(connection_, &seconds), SDS_ERROR_NONE);
@@ -321,12 +324,6 @@ TEST_F(DeckCommands, NextUpdateDurationFollowsTheFile) {
 }
 
 TEST_F(DeckCommands, FullIdsFollowTheCondition) {
-  // No condition: the live items in order_index order, exactly on the wire.
-  send_header(SDS_CMD_GET_FULL_IDS, 0);
-  ASSERT_TRUE(write_int(fd_, SDS_ERROR_NO_DATA));
-  EXPECT_EQ(read_words(fd_, 5), (std::vector<int32_t>{0, 3, 2, 1, 5}));
-  expect_nothing_pending();
-
   struct Case {
     const char* name;
     int32_t is_dirty;
@@ -340,20 +337,6 @@ TEST_F(DeckCommands, FullIdsFollowTheCondition) {
   sds_client_ids none;
   EXPECT_EQ(sds_client_get_ids_by_dirty(connection_, 7, &none), SDS_ERROR_NO_DATA);
   EXPECT_EQ(none.count, 0);
-}
-
-TEST_F(DeckCommands, FullIdsWithAnUnknownSelectorIsStatusFiveAlone) {
-  send_header(SDS_CMD_GET_FULL_IDS, 0);
-  const unsigned char condition[] = {0, 0, 0, 0, 2, 0};  // flag 0, selector 2
-  ASSERT_TRUE(write_all(fd_, condition, sizeof condition));
-  EXPECT_EQ(read_words(fd_, 1), std::vector<int32_t>{SDS_ERROR_INVALID_PARAMETER});
-  expect_nothing_pending();
-}
-
-TEST_F(DeckCommands, UrlLongerThanTheWireLimitIsStatusZeroAndNoString) {
-  send_header(SDS_CMD_GET_URL, 4);
-  EXPECT_EQ(read_words(fd_, 1), std::vector<int32_t>{SDS_ERROR_NONE});
-  expect_nothing_pending();
 }
 
 TEST_F(DeckCommands, NegativeItemIdGetsNoReplyAndTheConnectionGoesOn) {

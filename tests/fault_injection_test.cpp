@@ -1,10 +1,6 @@
-// Faults injected into the real service binary while it pulls from the
-// stand-in content server: the process killed at random moments of a pull, a
-// database file of garbage, data directories it may not write, a disk that
-// fills up, and server answers that break off, redirect without end or carry
-// icons that are no usable PNG. Whatever happens, the service must not crash,
-// must answer with a status, and must leave a database holding one whole list
-// that the next pull brings up to date.
+// Faults injected into the real service while it pulls from the stand-in
+// content server. Whatever happens, the service must not crash, must answer
+// with a status, and must leave one whole list that the next pull updates.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -41,23 +37,25 @@ constexpr const char* kHeraldIcon = "daily-herald/apple-touch-icon.png";
 constexpr const char* kGarden = "http://garden-life.example/";
 constexpr uid_t kNobody = 65534;
 
-// The live items as "id|url" in the service's order (command 11 for the
-// live ids, command 3 for each); empty, with `*status` set, when a step failed.
-std::vector<std::string> live_items(SdsConnection& connection, int* status = nullptr) {
-  int ignored = 0;
-  if (status == nullptr) status = &ignored;
+// The live items as "id|url" in the service's order; empty when a step failed.
+std::vector<std::string> live_items(SdsConnection& connection) {
   sds_client_ids ids;
-  *status = sds_client_get_ids_by_dirty(connection, 1, &ids);
-  if (*status != SDS_ERROR_NONE) return {};
+  if (sds_client_get_ids_by_dirty(connection, 1, &ids) != SDS_ERROR_NONE) return {};
   std::vector<std::string> items;
   for (int32_t i = 0; i < ids.count; ++i) {
     UniqueCStr url;
-    *status = sds_client_get_url(connection, ids.ids.get()[i], &url);
-    if (*status != SDS_ERROR_NONE) return {};
+    if (sds_client_get_url(connection, ids.ids.get()[i], &url) != SDS_ERROR_NONE) return {};
     items.push_back(std::to_string(ids.ids.get()[i]) + "|" + url.get());
   }
   return items;
 }
+
+// A service process (behind a wrapper such as prlimit or setpriv) and a
+// connection to it.
+struct ServiceRun {
+  ServiceHarness service;
+  SdsConnection connection;
+};
 
 class FaultInjection : public ::testing::Test {
  protected:
@@ -77,38 +75,40 @@ class FaultInjection : public ::testing::Test {
         .final;
   }
 
-  // One pull through a fresh service process, which must then end normally
-  // when the connection closes. -1 when the service could not be reached.
-  int pull(const std::vector<std::string>& wrapper = {}) {
-    ServiceHarness service;
-    if (!service.start_direct_wrapped(wrapper)) return -1;
-    SdsConnection connection;
-    if (service.connect(&connection, kReadTimeoutMs) != SDS_ERROR_NONE) {
-      ADD_FAILURE() << "no connection: " << service.output();
-      return -1;
+  // Starts the service and connects; false (with a failure) when it can't.
+  static bool start(ServiceRun* run, const std::vector<std::string>& wrapper = {}) {
+    if (!run->service.start_direct_wrapped(wrapper)) {
+      ADD_FAILURE() << "service not started";
+      return false;
     }
-    const int status = pull_on(connection);
-    connection.close();
-    expect_normal_exit(&service);
+    const int status = run->service.connect(&run->connection, kReadTimeoutMs);
+    EXPECT_EQ(status, SDS_ERROR_NONE) << run->service.output();
+    return status == SDS_ERROR_NONE;
+  }
+  // Closes the connection; the service must then end normally.
+  static void finish(ServiceRun* run) {
+    run->connection.close();
+    int wait_status = 0;
+    ASSERT_TRUE(run->service.wait_exit(&wait_status)) << run->service.output();
+    EXPECT_EQ(exit_code_of(wait_status), 0) << run->service.output();
+  }
+
+  // One pull through a fresh service process; -1 when it could not be reached.
+  int pull(const std::vector<std::string>& wrapper = {}) {
+    ServiceRun run;
+    if (!start(&run, wrapper)) return -1;
+    const int status = pull_on(run.connection);
+    finish(&run);
     return status;
   }
 
   // The live items as a fresh service process reports them.
-  std::vector<std::string> live(int* status = nullptr) {
-    ServiceHarness service;
-    EXPECT_TRUE(service.start_direct());
-    SdsConnection connection;
-    EXPECT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
-    std::vector<std::string> items = live_items(connection, status);
-    connection.close();
-    expect_normal_exit(&service);
+  std::vector<std::string> live() {
+    ServiceRun run;
+    if (!start(&run)) return {};
+    std::vector<std::string> items = live_items(run.connection);
+    finish(&run);
     return items;
-  }
-
-  static void expect_normal_exit(ServiceHarness* service) {
-    int wait_status = 0;
-    ASSERT_TRUE(service->wait_exit(&wait_status)) << service->output();
-    EXPECT_EQ(exit_code_of(wait_status), 0) << service->output();
   }
 
   // Copies the data directory aside, or puts the copy back in its place.
@@ -198,17 +198,15 @@ TEST_F(FaultInjection, PullKilledAtAnyMomentLeavesOneWholeListAndTheNextPullRepa
     const auto kill_after = std::chrono::duration_cast<std::chrono::microseconds>(
         whole_pull * ((round + jitter(random)) / 8.0));
     {
-      ServiceHarness service;
-      ASSERT_TRUE(service.start_direct());
-      SdsConnection connection;
-      ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE);
-      ASSERT_TRUE(send_initialize(connection.fd(), connection.cid(), kNoPosition, 0,
+      ServiceRun run;
+      ASSERT_TRUE(start(&run));
+      ASSERT_TRUE(send_initialize(run.connection.fd(), run.connection.cid(), kNoPosition, 0,
                                   SDS_ERROR_NO_DATA, nullptr));
       // This pause is the fault's moment, not a wait for an event.
       std::this_thread::sleep_for(kill_after);
-      ASSERT_TRUE(service.signal(SIGKILL));
+      ASSERT_TRUE(run.service.signal(SIGKILL));
       int wait_status = 0;
-      ASSERT_TRUE(service.wait_exit(&wait_status));
+      ASSERT_TRUE(run.service.wait_exit(&wait_status));
       EXPECT_TRUE(WIFSIGNALED(wait_status));
     }
     const std::vector<std::string> after_kill = live();
@@ -253,17 +251,14 @@ TEST_F(FaultInjection, DatabaseFileOfGarbageIsRebuiltAndTheNextPullRefillsIt) {
     SCOPED_TRACE(c.name);
     ASSERT_TRUE(write_file(data(SDS_DB_PATH), c.content));
     {
-      ServiceHarness service;
-      ASSERT_TRUE(service.start_direct());
-      SdsConnection connection;
-      ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE);
+      ServiceRun run;
+      ASSERT_TRUE(start(&run));
       sds_client_ids ids;
-      const int status = sds_client_get_full_ids(connection, &ids);
+      const int status = sds_client_get_full_ids(run.connection, &ids);
       if (c.rebuilt_at_open) {
-        EXPECT_EQ(status, SDS_ERROR_NO_DATA) << service.output();
+        EXPECT_EQ(status, SDS_ERROR_NO_DATA) << run.service.output();
       }
-      connection.close();
-      expect_normal_exit(&service);
+      finish(&run);
     }
     EXPECT_EQ(pull(), SDS_ERROR_NONE);
     EXPECT_EQ(live(), full);
@@ -281,18 +276,15 @@ TEST_F(FaultInjection, DataDirectoriesTheServiceMayNotWriteGiveStatusesNotCrashe
   {
     SCOPED_TRACE("server directory read-only: the answer cannot be saved");
     open_tree_for_nobody({SDS_DATABASE_DIR, SDS_IMAGES_DIR});
-    ServiceHarness service;
-    ASSERT_TRUE(service.start_direct_wrapped(kAsNobody));
-    SdsConnection connection;
-    ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
-    EXPECT_EQ(pull_on(connection), SDS_ERROR_IO_ERROR);
+    ServiceRun run;
+    ASSERT_TRUE(start(&run, kAsNobody));
+    EXPECT_EQ(pull_on(run.connection), SDS_ERROR_IO_ERROR);
     // The duration of the last answer could not be removed either.
     int32_t seconds = 0;
-    EXPECT_EQ(sds_client_get_next_update_duration(connection, &seconds), SDS_ERROR_NONE);
+    EXPECT_EQ(sds_client_get_next_update_duration(run.connection, &seconds), SDS_ERROR_NONE);
     EXPECT_EQ(seconds, 3600);
-    EXPECT_EQ(live_items(connection), old_list);
-    connection.close();
-    expect_normal_exit(&service);
+    EXPECT_EQ(live_items(run.connection), old_list);
+    finish(&run);
     EXPECT_EQ(read_file(data(SDS_ETAG_PATH)), etag);
   }
   {
@@ -318,14 +310,11 @@ TEST_F(FaultInjection, DataDirectoriesTheServiceMayNotWriteGiveStatusesNotCrashe
     restore();
     fs::remove(data(SDS_DB_PATH));
     open_tree_for_nobody({SDS_SERVER_DIR, SDS_IMAGES_DIR});
-    ServiceHarness service;
-    ASSERT_TRUE(service.start_direct_wrapped(kAsNobody));
-    SdsConnection connection;
-    ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
+    ServiceRun run;
+    ASSERT_TRUE(start(&run, kAsNobody));
     sds_client_ids ids;
-    EXPECT_EQ(sds_client_get_full_ids(connection, &ids), SDS_ERROR_IO_ERROR);
-    connection.close();
-    expect_normal_exit(&service);
+    EXPECT_EQ(sds_client_get_full_ids(run.connection, &ids), SDS_ERROR_IO_ERROR);
+    finish(&run);
   }
 }
 
@@ -339,14 +328,11 @@ TEST_F(FaultInjection, FileSizeLimitKilledTheServiceInsteadOfFailingTheWrite) {
   const std::string etag = read_file(data(SDS_ETAG_PATH));
   ASSERT_TRUE(content_.control({{"touch", kHerald}, {"body", "huge"}, {"huge_mb", "5"}}));
 
-  ServiceHarness service;
-  ASSERT_TRUE(service.start_direct_wrapped(file_size_limit(kShmBytes + 4096)));
-  SdsConnection connection;
-  ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
-  EXPECT_EQ(pull_on(connection), SDS_ERROR_SERVER_REQUEST_FAILED);
-  EXPECT_EQ(live_items(connection), old_list);
-  connection.close();
-  expect_normal_exit(&service);
+  ServiceRun run;
+  ASSERT_TRUE(start(&run, file_size_limit(kShmBytes + 4096)));
+  EXPECT_EQ(pull_on(run.connection), SDS_ERROR_SERVER_REQUEST_FAILED);
+  EXPECT_EQ(live_items(run.connection), old_list);
+  finish(&run);
   EXPECT_EQ(read_file(data(SDS_ETAG_PATH)), etag);
 }
 
@@ -397,27 +383,24 @@ TEST_F(FaultInjection, ServerFaultsGiveTheirStatusesAndTheServiceServesOn) {
     ASSERT_TRUE(write_server_list());
     fs::remove(data(SDS_ETAG_PATH));
     ASSERT_TRUE(content_.control(c.settings));
-    ServiceHarness service;
-    ASSERT_TRUE(service.start_direct());
-    SdsConnection connection;
-    ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE);
-    EXPECT_EQ(pull_on(connection), c.status);
+    ServiceRun run;
+    ASSERT_TRUE(start(&run));
+    EXPECT_EQ(pull_on(run.connection), c.status);
     // Served on: the same connection answers the next requests.
     sds_client_ids ids;
-    const int ids_status = sds_client_get_ids_by_dirty(connection, 1, &ids);
+    const int ids_status = sds_client_get_ids_by_dirty(run.connection, 1, &ids);
     EXPECT_TRUE(ids_status == SDS_ERROR_NONE || ids_status == SDS_ERROR_NO_DATA) << ids_status;
     if (c.status == SDS_ERROR_NONE) {
       // The broken icon's site is stored, without an icon.
       int32_t herald = -1;
-      for (const std::string& item : live_items(connection)) {
+      for (const std::string& item : live_items(run.connection)) {
         if (item.ends_with(std::string("|") + kHerald)) herald = std::stoi(item);
       }
       ASSERT_GT(herald, 0);
       sds_client_icon icon;
-      EXPECT_EQ(sds_client_get_icon(connection, herald, &icon), SDS_ERROR_NO_DATA);
+      EXPECT_EQ(sds_client_get_icon(run.connection, herald, &icon), SDS_ERROR_NO_DATA);
     }
-    connection.close();
-    expect_normal_exit(&service);
+    finish(&run);
     EXPECT_EQ(files_in(SDS_IMAGES_DIR), 0u);
     EXPECT_FALSE(file_exists(data(SDS_ETAG_TO_UPDATE_PATH)));
   }
@@ -428,17 +411,12 @@ TEST_F(FaultInjection, LongListOpenedAFilePerIconAtOnceAndRanOutOfDescriptors) {
   ContentServerProcess big({"--items", "300"});
   ASSERT_TRUE(big.ok());
   ASSERT_TRUE(::write_server_list({{1, big.base_url()}}));
-  ServiceHarness service;
-  ASSERT_TRUE(service.start_direct_wrapped({"/usr/bin/prlimit", "--nofile=128", "--"}));
-  SdsConnection connection;
-  ASSERT_EQ(service.connect(&connection, kReadTimeoutMs), SDS_ERROR_NONE) << service.output();
-  EXPECT_EQ(pull_on(connection), SDS_ERROR_NONE);
-  sds_client_ids ids;
-  ASSERT_EQ(sds_client_get_ids_by_dirty(connection, 1, &ids), SDS_ERROR_NONE);
-  EXPECT_EQ(ids.count, 300);
-  connection.close();
-  expect_normal_exit(&service);
-  EXPECT_FALSE(service.has_message("[CRITICAL]  Unable to open Image File"));
+  ServiceRun run;
+  ASSERT_TRUE(start(&run, {"/usr/bin/prlimit", "--nofile=128", "--"}));
+  EXPECT_EQ(pull_on(run.connection), SDS_ERROR_NONE);
+  EXPECT_EQ(live_items(run.connection).size(), 300u);
+  finish(&run);
+  EXPECT_FALSE(run.service.has_message("[CRITICAL]  Unable to open Image File"));
   EXPECT_EQ(
       rows_of_file(data(SDS_DB_PATH), "SELECT count(*) FROM site_deck WHERE length(icon_data) > 0"),
       "300");

@@ -88,10 +88,17 @@ class WorkerTest : public ::testing::Test {
   LogCapture log_;
 };
 
+sds_client slot_on(const SocketPair& pair, int32_t client_id) {
+  sds_client slot;
+  slot.client_id = client_id;
+  slot.sock = pair.service.get();
+  return slot;
+}
+
 TEST_F(WorkerTest, HeaderCheckEndsTheConnectionOnUnusableHeaders) {
   struct Case {
     const char* name;
-    std::vector<int32_t> words;  // what the client sends in one write
+    std::vector<int32_t> words;  // what the client sends in one write; none: it closes
     int result;
     int client_id_after;
     const char* message;  // the "[Closed Peer]" line's cmd/cid part, if any
@@ -101,40 +108,30 @@ TEST_F(WorkerTest, HeaderCheckEndsTheConnectionOnUnusableHeaders) {
       {"cid 0", {3, 0, 0}, SDS_ERROR_IO_ERROR, -1, "cmd 3 cid 0 "},
       {"negative cid", {3, -4, 0}, SDS_ERROR_IO_ERROR, -1, "cmd 3 cid -4 "},
       {"only the first 4 bytes", {3}, SDS_ERROR_IO_ERROR, -1, "cmd 3 cid 0 "},
+      {"peer closed", {}, SDS_ERROR_IO_ERROR, -1, nullptr},
   };
   for (const auto& c : cases) {
     SocketPair pair;
-    sds_client slot;
-    slot.client_id = 9;
-    slot.sock = pair.service.get();
+    sds_client slot = slot_on(pair, 9);
     ASSERT_TRUE(write_all(pair.peer.get(), c.words.data(), c.words.size() * sizeof(int32_t)));
+    if (c.words.empty()) pair.peer.reset();
     EXPECT_EQ(__sds_handle_client_request(&slot), c.result) << c.name;
     EXPECT_EQ(slot.client_id, c.client_id_after) << c.name;
     if (c.message != nullptr) {
       EXPECT_TRUE(log_.contains(format("[Closed Peer] sock:%d %s", slot.sock, c.message)))
           << c.name;
     }
-    EXPECT_FALSE(readable_now(pair.peer.get())) << c.name;
+    if (pair.peer) {
+      EXPECT_FALSE(readable_now(pair.peer.get())) << c.name;
+    }
   }
-}
-
-TEST_F(WorkerTest, ClosedPeerEndsTheConnection) {
-  SocketPair pair;
-  sds_client slot;
-  slot.client_id = 9;
-  slot.sock = pair.service.get();
-  pair.peer.reset();
-  EXPECT_EQ(__sds_handle_client_request(&slot), SDS_ERROR_IO_ERROR);
-  EXPECT_EQ(slot.client_id, -1);
 }
 
 // A quit issued before the main thread enters the loop used to be lost, which
 // left the process running with nothing to end it.
 TEST_F(WorkerTest, WorkerEndingBeforeTheLoopRunsStillEndsTheLoop) {
   SocketPair pair;
-  sds_client slot;
-  slot.client_id = 7;
-  slot.sock = pair.service.get();
+  sds_client slot = slot_on(pair, 7);
   pair.peer.reset();
   pthread_t worker{};
   ASSERT_EQ(pthread_create(&worker, nullptr, sds_client_thread_idle, &slot), 0);
@@ -145,9 +142,7 @@ TEST_F(WorkerTest, WorkerEndingBeforeTheLoopRunsStillEndsTheLoop) {
 
 TEST_F(WorkerTest, WorkerServesRequestsUntilABadHeader) {
   SocketPair pair;
-  sds_client slot;
-  slot.client_id = 7;
-  slot.sock = pair.service.get();
+  sds_client slot = slot_on(pair, 7);
   const int32_t requests[] = {12, 7, 0, 0, 7, 0};  // unknown command, then command 0
   ASSERT_TRUE(write_all(pair.peer.get(), requests, sizeof requests));
   pthread_t worker{};
@@ -161,18 +156,14 @@ TEST_F(WorkerTest, WorkerServesRequestsUntilABadHeader) {
   EXPECT_FALSE(readable_now(pair.peer.get()));  // the unknown command got no reply
 }
 
-TEST_F(WorkerTest, AcceptorRefusesMissingContextAndSocket) {
+TEST_F(WorkerTest, AcceptorRefusesMissingContextAndSocketAndReportsAFailedAccept) {
   EXPECT_EQ(sds_main_thread(nullptr), -1);
   EXPECT_TRUE(log_.contains("[CRITICAL] Invalid Address"));
   sds_server_context context;
   context.listen_sock = -1;
   EXPECT_EQ(sds_main_thread(&context), -1);
   EXPECT_TRUE(log_.contains("[CRITICAL] Invalid File Discriptor"));
-}
-
-TEST_F(WorkerTest, AcceptorReportsAFailedAccept) {
   UniqueFd not_listening(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  sds_server_context context;
   context.listen_sock = not_listening.get();
   EXPECT_EQ(sds_main_thread(&context), -1);
   EXPECT_TRUE(log_.contains("[CRITICAL] accept Sitedeck service was crashed ?"));

@@ -14,7 +14,6 @@
 #include <string>
 #include <vector>
 
-#include "database/sitedeck-service-db-interface.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-request-handler-internal.h"
@@ -27,6 +26,7 @@ namespace {
 
 constexpr int kIconBytes = 2 * 3 * 4;  // the seeded icon is 2x3
 constexpr int kAttempts = 5;
+const std::vector<int32_t> kServed = {0, kIconBytes, 2, 3};  // status, bytes, width, height
 
 // The identity of the object now behind the name; 0 when there is none.
 ino_t object_inode() {
@@ -95,8 +95,13 @@ class ServingReplies : public ::testing::Test {
     while (readable_now(pair_.peer.get()) && read(pair_.peer.get(), buffer, sizeof buffer) > 0) {
     }
   }
+  // Serves command 7 for item 1 and reads a reply of `words` 32-bit items.
+  std::vector<int32_t> icon_reply(size_t words = 4) {
+    (void)_sds_get_blob(pair_.service.get(), 1);
+    return read_reply(words);
+  }
   // Reads one reply of `words` 32-bit items from the peer's end.
-  std::vector<int32_t> reply(size_t words) {
+  std::vector<int32_t> read_reply(size_t words) {
     std::vector<int32_t> out(words, -1);
     if (!readable_now(pair_.peer.get()) ||
         read(pair_.peer.get(), out.data(), words * 4) != static_cast<ssize_t>(words * 4)) {
@@ -162,16 +167,13 @@ TEST_F(ServingReplies, IconsShareOneMappingOfTheObject) {
     seen_t now;
     ino_t object = object_inode();
     int before = shm_mappings();
-    for (int i = 0; i < 20; ++i) {
-      (void)_sds_get_blob(pair_.service.get(), 1);
-      now.replies.push_back(reply(4));
-    }
+    for (int i = 0; i < 20; ++i) now.replies.push_back(icon_reply());
     now.added_mappings = shm_mappings() - before;
     now.pixels = shm_prefix(kIconBytes);
     now.undisturbed = object_inode() == object;
     return now;
   });
-  for (const auto& r : seen.replies) EXPECT_EQ(r, (std::vector<int32_t>{0, kIconBytes, 2, 3}));
+  for (const auto& r : seen.replies) EXPECT_EQ(r, kServed);
   EXPECT_EQ(seen.added_mappings, 1);
   EXPECT_EQ(seen.pixels, icon());
 }
@@ -186,27 +188,24 @@ TEST_F(ServingReplies, IconWhileTheObjectIsGoneIsStatusTwoAndServedAgainOnceItIs
   seen_t seen = observe_undisturbed([&] {
     seen_t now;
     ino_t object = object_inode();
-    (void)_sds_get_blob(pair_.service.get(), 1);
-    now.first = reply(4);
+    now.first = icon_reply();
     bool ours = object_inode() == object && shm_unlink(SDS_SHM_NAME) == 0;
     {
       LogCapture log;
-      (void)_sds_get_blob(pair_.service.get(), 1);
-      now.while_gone = reply(1);
+      now.while_gone = icon_reply(1);
       now.logged_why = log.contains("[CRITICAL] Unknown error");
     }
     ours = ours && object_inode() == 0 && sds_alloc_shm() == 1;
     object = object_inode();
-    (void)_sds_get_blob(pair_.service.get(), 1);
-    now.once_back = reply(4);
+    now.once_back = icon_reply();
     now.pixels = shm_prefix(kIconBytes);
     now.undisturbed = ours && object_inode() == object;
     return now;
   });
-  EXPECT_EQ(seen.first, (std::vector<int32_t>{0, kIconBytes, 2, 3}));
+  EXPECT_EQ(seen.first, kServed);
   EXPECT_EQ(seen.while_gone, std::vector<int32_t>{SDS_ERROR_SHM_FAILED});
   EXPECT_TRUE(seen.logged_why);
-  EXPECT_EQ(seen.once_back, (std::vector<int32_t>{0, kIconBytes, 2, 3}));
+  EXPECT_EQ(seen.once_back, kServed);
   EXPECT_EQ(seen.pixels, icon());
 }
 
@@ -221,29 +220,27 @@ TEST_F(ServingReplies, ReleaseLetsTheMappingGoAndTheNextObjectGetsTheIcon) {
   seen_t seen = observe_undisturbed([&] {
     seen_t now;
     ino_t object = object_inode();
-    (void)_sds_get_blob(pair_.service.get(), 1);
-    now.first = reply(4);
+    now.first = icon_reply();
     int with_mapping = shm_mappings();
     sds_client slot;
     slot.client_id = 5;
     slot.sock = pair_.service.get();
     bool ours = object_inode() == object;
     now.released = _sds_release_shm(&slot);
-    now.release = reply(1);
+    now.release = read_reply(1);
     now.mappings_dropped = with_mapping - shm_mappings();
     ours = ours && sds_alloc_shm() == 1;
     object = object_inode();
-    (void)_sds_get_blob(pair_.service.get(), 1);
-    now.once_back = reply(4);
+    now.once_back = icon_reply();
     now.pixels = shm_prefix(kIconBytes);
     now.undisturbed = ours && object_inode() == object;
     return now;
   });
-  EXPECT_EQ(seen.first, (std::vector<int32_t>{0, kIconBytes, 2, 3}));
+  EXPECT_EQ(seen.first, kServed);
   EXPECT_EQ(seen.released, SDS_ERROR_NONE);
   EXPECT_EQ(seen.release, std::vector<int32_t>{SDS_ERROR_NONE});
   EXPECT_EQ(seen.mappings_dropped, 1);
-  EXPECT_EQ(seen.once_back, (std::vector<int32_t>{0, kIconBytes, 2, 3}));
+  EXPECT_EQ(seen.once_back, kServed);
   EXPECT_EQ(seen.pixels, icon());
 }
 

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <fstream>
 #include <string>
 
 #include "sitedeck-service-paths.h"
@@ -35,21 +36,14 @@ class ShmTest : public ::testing::Test {
   LogCapture log_;
 };
 
+// The owner is the "app" account only where it exists.
 TEST_F(ShmTest, CreatingTwiceGivesTheFullSizeWithOpenPermissions) {
   ASSERT_EQ(sds_alloc_shm(), 1);
   ASSERT_EQ(sds_alloc_shm(), 1);
-  UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDONLY, 0));
-  ASSERT_TRUE(fd);
-  struct stat st {};
-  ASSERT_EQ(fstat(fd.get(), &st), 0);
-  EXPECT_EQ(static_cast<size_t>(st.st_size), SDS_SHM_SIZE);
-  EXPECT_EQ(st.st_mode & 07777, 0666u);
-}
-
-TEST_F(ShmTest, OwnerIsTheAppAccountOnlyWhereItExists) {
-  ASSERT_EQ(sds_alloc_shm(), 1);
   struct stat st {};
   ASSERT_EQ(stat(SDS_SHM_FILE_PATH, &st), 0);
+  EXPECT_EQ(static_cast<size_t>(st.st_size), SDS_SHM_SIZE);
+  EXPECT_EQ(st.st_mode & 07777, 0666u);
   const struct passwd* user = getpwnam("app");
   const struct group* group = getgrnam("app");
   bool app_exists = user != nullptr && group != nullptr;
@@ -57,14 +51,7 @@ TEST_F(ShmTest, OwnerIsTheAppAccountOnlyWhereItExists) {
   EXPECT_EQ(st.st_gid, app_exists ? group->gr_gid : getegid());
 }
 
-// Reads or sets a kernel switch under /proc/sys; false when it can't.
-bool read_sysctl(const char* path, std::string* value) {
-  UniqueFd fd(open(path, O_RDONLY));
-  char text[16] = {};
-  if (!fd || read(fd.get(), text, sizeof text - 1) <= 0) return false;
-  *value = text;
-  return true;
-}
+// Sets a kernel switch under /proc/sys; false when it can't.
 bool write_sysctl(const char* path, const std::string& value) {
   UniqueFd fd(open(path, O_WRONLY));
   return fd && write(fd.get(), value.data(), value.size()) == static_cast<ssize_t>(value.size());
@@ -77,7 +64,7 @@ TEST_F(ShmTest, ObjectOwnedByAnotherAccountIsReopenedUnderProtectedRegular) {
   constexpr const char* kSwitch = "/proc/sys/fs/protected_regular";
   const struct passwd* other = getpwnam("nobody");
   std::string before;
-  if (geteuid() != 0 || other == nullptr || !read_sysctl(kSwitch, &before)) {
+  if (geteuid() != 0 || other == nullptr || !(std::ifstream(kSwitch) >> before)) {
     GTEST_SKIP() << "needs root, the account nobody and " << kSwitch;
   }
   if (!write_sysctl(kSwitch, "1")) GTEST_SKIP() << kSwitch << " can't be set here";
@@ -110,15 +97,12 @@ TEST_F(ShmTest, MappingsShareTheContent) {
   EXPECT_EQ(sds_dettach_shm(reader), 1);
 }
 
-TEST_F(ShmTest, RemovingTwiceFailsTheSecondTime) {
+TEST_F(ShmTest, RemovingTwiceFailsTheSecondTimeAndAttachingThenFails) {
   ASSERT_EQ(sds_alloc_shm(), 1);
   EXPECT_EQ(sds_free_shm(), 1);
   EXPECT_EQ(sds_free_shm(), 0);
   // The message's own line feed ends the log line.
   EXPECT_EQ(log_.count("[CRITICAL] Error removing /browser_sds_shm_file"), 1);
-}
-
-TEST_F(ShmTest, AttachWithoutTheObjectFails) {
   EXPECT_EQ(sds_attach_shm(), nullptr);
   EXPECT_TRUE(log_.contains("[CRITICAL] Unknown error"));
 }

@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <sys/wait.h>
 
+#include <algorithm>
 #include <csignal>
 #include <filesystem>
 #include <set>
@@ -126,7 +127,7 @@ TEST_F(Soak, ThirtyConnectionsInARowLeaveTheActivatorFlatAndNothingBehind) {
   ServiceHarness activator;
   ASSERT_TRUE(activator.start_activated(false));
   long failures = 0;
-  long fds_min = -1, fds_max = -1, maps_min = -1, maps_max = -1;
+  std::vector<long> fds, maps;  // of each connection's service process
   ProcStats first;
   for (int n = 0; n < 30; ++n) {
     SdsConnection connection;
@@ -135,15 +136,15 @@ TEST_F(Soak, ThirtyConnectionsInARowLeaveTheActivatorFlatAndNothingBehind) {
     const std::vector<pid_t> services = proc_children(activator.pid());
     ASSERT_EQ(services.size(), 1u);
     const ProcStats s = proc_stats(services[0]);
-    fds_min = fds_min < 0 ? s.fds : std::min(fds_min, s.fds);
-    fds_max = std::max(fds_max, s.fds);
-    maps_min = maps_min < 0 ? s.mappings : std::min(maps_min, s.mappings);
-    maps_max = std::max(maps_max, s.mappings);
+    fds.push_back(s.fds);
+    maps.push_back(s.mappings);
     if (n == 0) first = proc_stats(activator.pid());
     EXPECT_EQ(sds_client_release_shm(connection), SDS_ERROR_NONE);
   }
   const ProcStats last = proc_stats(activator.pid());
   EXPECT_EQ(failures, 0);
+  const auto [fds_min, fds_max] = std::ranges::minmax(fds);
+  const auto [maps_min, maps_max] = std::ranges::minmax(maps);
   EXPECT_EQ(fds_min, fds_max);
   EXPECT_LE(maps_max - maps_min, kMapsJitter);
   EXPECT_EQ(last.fds, first.fds);
