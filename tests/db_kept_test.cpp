@@ -89,7 +89,10 @@ TEST_F(DbKept, KeptColumnsReadAsTheTableDoes) {
                                                   {"touch_icon_exists", true},
                                                   {"favicon_exists", true}};
   for (int id : {1, 2, 3, 9}) {
-    for (auto [column, as_int] : columns) {
+    for (const auto& entry : columns) {
+      // Named copies: clang 14 can't capture structured bindings in a lambda.
+      const char* column = entry.first;
+      const bool as_int = entry.second;
       SCOPED_TRACE(std::to_string(id) + " " + column);
       read_outcome from_table = read_from_table([&] { return read(id, column, as_int); });
       // The first read fills what is kept, the second is answered from it.
