@@ -15,6 +15,7 @@
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
+#include "support/json_match.h"
 #include "support/pull_env.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"
@@ -131,23 +132,6 @@ TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
     EXPECT_EQ(result.out, "") << c.arguments[1];
   }
   EXPECT_FALSE(file_exists(root_.dir() + "/none.png"));
-}
-
-struct JsonParserFree {
-  void operator()(JsonParser* parser) const { g_object_unref(parser); }
-};
-using UniqueJsonParser = std::unique_ptr<JsonParser, JsonParserFree>;
-
-// Whether the tool printed the JSON document `expected`: the same members
-// with the same values and types, in any order.
-::testing::AssertionResult IsJson(const std::string& text, const std::string& expected) {
-  UniqueJsonParser got(json_parser_new()), want(json_parser_new());
-  if (!json_parser_load_from_data(got.get(), text.c_str(), -1, nullptr) ||
-      !json_parser_load_from_data(want.get(), expected.c_str(), -1, nullptr) ||
-      !json_node_equal(json_parser_get_root(got.get()), json_parser_get_root(want.get()))) {
-    return ::testing::AssertionFailure() << "printed " << text;
-  }
-  return ::testing::AssertionSuccess();
 }
 
 // Whole values and nulls for what is not stored; the option may follow the
