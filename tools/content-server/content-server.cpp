@@ -4,6 +4,7 @@
 #include <glib.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cstdio>
 #include <memory>
 
@@ -23,7 +24,23 @@ std::string md5_hex(const std::string& text) {
   return hex;
 }
 
-// Value of `name` in a raw query ("a=1&b=2&"), or empty.
+// `text` with every %XX escape decoded; a '%' without two hex digits stays.
+std::string percent_decoded(const std::string& text) {
+  std::string out;
+  for (size_t i = 0; i < text.size(); ++i) {
+    if (text[i] == '%' && i + 2 < text.size() && std::isxdigit(static_cast<unsigned char>(text[i + 1])) &&
+        std::isxdigit(static_cast<unsigned char>(text[i + 2]))) {
+      out.push_back(static_cast<char>(std::stoi(text.substr(i + 1, 2), nullptr, 16)));
+      i += 2;
+    } else {
+      out.push_back(text[i]);
+    }
+  }
+  return out;
+}
+
+// Value of `name` in a raw query ("a=1&b=2&"), decoded, or empty. The
+// signature is checked over the raw query first, as a real server would.
 std::string query_value(const std::string& query, const std::string& name) {
   size_t start = 0;
   while (start <= query.size()) {
@@ -31,7 +48,7 @@ std::string query_value(const std::string& query, const std::string& name) {
     if (end == std::string::npos) end = query.size();
     const std::string part = query.substr(start, end - start);
     if (part.size() > name.size() && part.compare(0, name.size() + 1, name + "=") == 0) {
-      return part.substr(name.size() + 1);
+      return percent_decoded(part.substr(name.size() + 1));
     }
     start = end + 1;
   }
@@ -63,14 +80,15 @@ void consume_fault(cs_server* s) {
 
 void set_caching_headers(httplib::Response& res, const cs_faults& f, const std::string& etag) {
   if (f.etag == "normal") {
-    res.set_header("ETag", etag);
+    res.set_header(f.lower_names ? "etag" : "ETag", etag);
   } else if (f.etag == "lower") {
     res.set_header("etag", etag);
   }
+  const char* cache_control = f.lower_names ? "cache-control" : "Cache-Control";
   if (f.cache_control.empty()) {
-    res.set_header("Cache-Control", "max-age=" + std::to_string(f.max_age));
+    res.set_header(cache_control, "max-age=" + std::to_string(f.max_age));
   } else if (f.cache_control != "none") {
-    res.set_header("Cache-Control", f.cache_control);
+    res.set_header(cache_control, f.cache_control);
   }
 }
 
@@ -88,6 +106,17 @@ void answer_body_fault(httplib::Response& res, const cs_faults& f, const std::st
           static const std::string spaces(kHugeChunk, ' ');
           return sink.write(spaces.data(), std::min(length, spaces.size()));
         });
+    return;
+  }
+  if (f.body == cs_body_fault::drip) {
+    // The whole list, one byte at a time: fast enough for any stall guard
+    // that asks for a byte a second, slow enough to take hours.
+    const long drip_ms = f.drip_ms;
+    res.set_content_provider(body->size(), "application/json",
+                             [body, drip_ms](size_t offset, size_t, httplib::DataSink& sink) {
+                               if (offset > 0 && !standin_wait_ms(drip_ms)) return false;
+                               return sink.write(body->data() + offset, 1);
+                             });
     return;
   }
   const bool stall = f.body == cs_body_fault::stall;
@@ -122,7 +151,7 @@ void handle_item_list(cs_server* s, const httplib::Request& req, httplib::Respon
     consume_fault(s);
     res.status = f.status;
     if (f.status >= 300 && f.status < 400 && !f.location.empty()) {
-      res.set_header("Location", f.location);
+      res.set_header(f.lower_names ? "location" : "Location", f.location);
     }
     if (f.status == 304) {
       cs_faults no_etag = f;  // a forced 304 has no list, so no ETag to send
@@ -198,6 +227,17 @@ void handle_icon(cs_server* s, const httplib::Request& req, httplib::Response& r
   if (!known || fault == cs_icon_fault::not_found) {
     res.status = 404;
     res.set_content("<html><body><h1>404 Not Found</h1></body></html>\n", "text/html");
+    return;
+  }
+  if (fault == cs_icon_fault::bomb) {
+    // A real PNG of a few KiB whose pixels fill 4 MiB.
+    icon.pixels = 1024;
+    std::string bomb;
+    if (!cs_render_icon_png(icon, &bomb)) {
+      res.status = 500;
+      return;
+    }
+    res.set_content(bomb, "image/png");
     return;
   }
   if (cached.empty()) {
@@ -283,9 +323,10 @@ std::string set_locked(cs_server* s, const std::string& key, const std::string& 
     static const std::map<std::string, cs_body_fault> kBodies = {{"normal", cs_body_fault::none},
                                                                  {"stall", cs_body_fault::stall},
                                                                  {"cut", cs_body_fault::cut},
-                                                                 {"huge", cs_body_fault::huge}};
+                                                                 {"huge", cs_body_fault::huge},
+                                                                 {"drip", cs_body_fault::drip}};
     const auto found = kBodies.find(value);
-    if (found == kBodies.end()) return "expects normal, stall, cut or huge";
+    if (found == kBodies.end()) return "expects normal, stall, cut, huge or drip";
     f.body = found->second;
     return std::string();
   }
@@ -293,6 +334,12 @@ std::string set_locked(cs_server* s, const std::string& key, const std::string& 
   if (key == "delay_ms") return number(0, 600000, &f.delay_ms);
   if (key == "stall_s") return number(1, 600, &f.stall_s);
   if (key == "huge_mb") return number(1, 4096, &f.huge_mb);
+  if (key == "drip_ms") return number(1, 600000, &f.drip_ms);
+  if (key == "header_case") {
+    if (value != "normal" && value != "lower") return "expects normal or lower";
+    f.lower_names = value == "lower";
+    return std::string();
+  }
   if (key == "max_age") return number(-1000000000, 1000000000, &f.max_age);
   if (key == "etag") {
     if (value != "normal" && value != "none" && value != "lower") {
@@ -310,7 +357,8 @@ std::string set_locked(cs_server* s, const std::string& key, const std::string& 
       {"icon_404", cs_icon_fault::not_found},
       {"icon_garbage", cs_icon_fault::garbage},
       {"icon_huge", cs_icon_fault::huge},
-      {"icon_truncated", cs_icon_fault::truncated}};
+      {"icon_truncated", cs_icon_fault::truncated},
+      {"icon_bomb", cs_icon_fault::bomb}};
   const auto icon_fault = kIconFaults.find(key);
   if (icon_fault != kIconFaults.end()) {
     if (value.empty()) return "expects an icon file";

@@ -15,8 +15,8 @@
 
 #include "catalogue.h"
 
-enum class cs_body_fault { none, stall, cut, huge };
-enum class cs_icon_fault { none, not_found, garbage, huge, truncated };
+enum class cs_body_fault { none, stall, cut, huge, drip };
+enum class cs_icon_fault { none, not_found, garbage, huge, truncated, bomb };
 
 struct cs_faults {
   int status = 200;      // answer to item-list requests
@@ -26,7 +26,9 @@ struct cs_faults {
   long delay_ms = 0;            // before every answer but the control routes
   long stall_s = 120;           // how long a stalled body hangs at most
   long huge_mb = 64;            // size of a huge body
+  long drip_ms = 1000;          // a dripping body sends one byte per this many ms
   std::string etag = "normal";  // normal, none (no ETag), lower ("etag:" header)
+  bool lower_names = false;     // ETag, Cache-Control and Location named in lower case
   long max_age = 3600;
   std::string cache_control;  // sent instead of "max-age=N" when set; "none" omits it
   std::map<std::string, cs_icon_fault> icons;  // by file below /icons/
