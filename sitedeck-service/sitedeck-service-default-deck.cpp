@@ -16,6 +16,7 @@
 #include "database/sitedeck-service-db-interface.h"
 #include "sitedeck-service-download-icon.h"
 #include "sitedeck-service-file-read.h"
+#include "sitedeck-service-file-write.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
@@ -50,15 +51,11 @@ bool __copy_deck_icon(const sds_icon* icon) {
   if (!bytes) return false;
   UniqueCStr target(get_icon_path(icon->icon_path));
   if (!target) return false;
-  UniqueFile file(std::fopen(target.get(), "wb"));
-  if (!file) {
+  if (!sds_write_file_whole(target.get(), bytes.get(), length)) {
     SDS_LOGE("[CRITICAL]  Unable to open Image File");
     return false;
   }
-  bool ok = std::fwrite(bytes.get(), 1, length, file.get()) == length;
-  ok = std::fclose(file.release()) == 0 && ok;
-  if (!ok) (void)remove_file(target.get());
-  return ok;
+  return true;
 }
 
 void __drop_icons(sds_item* item) {
@@ -115,8 +112,9 @@ int sds_default_deck_load(void) {
   const int pull_error = sds_last_error;
   sds_last_error = SDS_ERROR_NONE;
   sds_parse_json_data(list_path.c_str());
-  const bool cut_short = sds_last_error != SDS_ERROR_NONE;
+  const bool cut_short = sds_last_error == SDS_ERROR_OUT_OF_MEMORY;
   sds_last_error = pull_error;
+  if (sds_item_list_head != nullptr) (void)sds_drop_unusable_items();
   if (sds_item_list_head == nullptr) {
     SDS_LOGE("default deck not loaded: no item list in %s", list_path.c_str());
     return SDS_ERROR_NO_DATA;

@@ -2,10 +2,15 @@
 // icon, fetched into the images directory when it differs from the stored one,
 // or no icon at all. Downloads run a few at a time over reused connections;
 // the outcome per item is the same as fetching them one by one in list order.
+// An icon file is written beside its name and renamed into place once the
+// transfer completed with a success status, so the images directory never
+// holds a partial icon and no symlink there is followed. A failed icon is
+// logged with its site, its URL and the reason.
 #include "sitedeck-service-download-icon.h"
 
 #include <curl/curl.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <map>
@@ -15,6 +20,7 @@
 
 #include "database/sitedeck-service-db-interface.h"
 #include "database/sitedeck-service-db-stmt-cache.h"
+#include "sitedeck-service-file-write.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-request-server.h"
@@ -37,15 +43,19 @@ using UniqueCurlMulti = std::unique_ptr<CURLM, CurlMultiDeleter>;
 
 // One icon file being written; refuses to grow past the icon size limit.
 struct IconSink {
-  UniqueFile file;
+  std::unique_ptr<SdsFileBeside> file;
   size_t written = 0;
+  bool over = false;
 };
 
 size_t write_icon_block(char* data, size_t size, size_t count, void* user) {
   auto* sink = static_cast<IconSink*>(user);
   size_t bytes = size * count;
-  if (sink->written + bytes > SDS_MAX_ICON_BYTES) return 0;  // aborts the transfer
-  size_t items = std::fwrite(data, size, count, sink->file.get());
+  if (sink->written + bytes > SDS_MAX_ICON_BYTES) {
+    sink->over = true;
+    return 0;  // aborts the transfer
+  }
+  size_t items = std::fwrite(data, size, count, sink->file->get());
   sink->written += items * size;
   return items;
 }
@@ -55,22 +65,24 @@ size_t write_icon_block(char* data, size_t size, size_t count, void* user) {
 struct IconTransfer {
   sds_icon* icon = nullptr;
   IconSink sink;
-  std::string path;      // the icon's file, once it was made
   bool ok = false;
+  std::string failure;  // why it failed, for the log
+  char error[CURL_ERROR_SIZE] = {};
 };
 
-// The file of a transfer that did not complete goes, so that no partial icon
-// is left in the images directory.
-void drop_partial_file(IconTransfer* t) {
-  t->sink.file.reset();
-  if (!t->ok && !t->path.empty()) (void)std::remove(t->path.c_str());
-}
-
-// Checks a finished transfer the way a single download is judged, and
-// closes its file.
-bool finish_transfer(CURL* curl, IconSink* sink, CURLcode result) {
+// Judges a finished transfer and, when it completed with a success status,
+// puts its file in place; otherwise the partial file goes.
+bool finish_transfer(CURL* curl, IconTransfer* t, CURLcode result) {
+  std::unique_ptr<SdsFileBeside> file = std::move(t->sink.file);
   if (result != CURLE_OK) {
     SDS_LOGE("[CRITICAL] Failed to perform easy perfomr[%d] \n", static_cast<int>(result));
+    if (t->sink.over || result == CURLE_FILESIZE_EXCEEDED) {
+      t->failure = "larger than " + std::to_string(SDS_MAX_ICON_BYTES) + " bytes";
+    } else if (result == CURLE_OPERATION_TIMEDOUT && sds_pull_ms_left() == 0) {
+      t->failure = "the pull's deadline passed";
+    } else {
+      t->failure = t->error[0] != '\0' ? t->error : curl_easy_strerror(result);
+    }
     return false;
   }
   long status = 0;
@@ -78,6 +90,7 @@ bool finish_transfer(CURL* curl, IconSink* sink, CURLcode result) {
   if (info != CURLE_OK) {
     SDS_LOGE("[CRITICAL] curl_easy_getinfo Failed: CURLINFO_HTTP_CODE with error code[%d] \n",
              static_cast<int>(info));
+    t->failure = "no HTTP status";
     return false;
   }
   curl_off_t downloaded = 0;
@@ -85,10 +98,19 @@ bool finish_transfer(CURL* curl, IconSink* sink, CURLcode result) {
   if (info != CURLE_OK) {
     SDS_LOGE("[CRITICAL] curl_easy_getinfo Failed : CURLINFO_SIZE_DOWNLOAD with error code[%d]",
              static_cast<int>(info));
+    t->failure = "no download size";
     return false;
   }
-  // The status is not judged here: a body that is no PNG is refused when stored.
-  return std::fclose(sink->file.release()) == 0;
+  // An error page is no icon: the download failed, as a broken transfer does.
+  if (status < 200 || status > 299) {
+    t->failure = "HTTP " + std::to_string(status);
+    return false;
+  }
+  if (!file->commit()) {
+    t->failure = std::string("its file could not be written: ") + std::strerror(errno);
+    return false;
+  }
+  return true;
 }
 
 // The handles that fetch icons, kMaxParallelDownloads at most. A handle keeps
@@ -146,20 +168,34 @@ CURL* IconFetcher::take_handle() {
 
 bool IconFetcher::start(IconTransfer* t) {
   UniqueCStr path(get_icon_path(t->icon->icon_path));
-  if (!path) return false;
+  if (!path) {
+    t->failure = "its URL names no file";
+    return false;
+  }
   CURL* curl = take_handle();
-  if (curl == nullptr) return false;
-  t->sink.file.reset(std::fopen(path.get(), "wb"));
-  if (!t->sink.file) {
-    SDS_LOGE("[CRITICAL]  Unable to open Image File");
+  if (curl == nullptr) {
+    t->failure = "no transfer handle";
+    return false;
+  }
+  if (!sds_transfer_apply_deadline(curl, SDS_TRANSFER_ICON)) {
+    t->failure = "the pull's deadline passed";
     give_back(curl);
     return false;
   }
-  t->path = path.get();
+  t->sink.file = std::make_unique<SdsFileBeside>(path.get());
+  if (t->sink.file->get() == nullptr) {
+    SDS_LOGE("[CRITICAL]  Unable to open Image File");
+    t->failure = std::string("its file could not be made: ") + std::strerror(errno);
+    t->sink.file.reset();
+    give_back(curl);
+    return false;
+  }
   (void)curl_easy_setopt(curl, CURLOPT_URL, t->icon->icon_path);
   (void)curl_easy_setopt(curl, CURLOPT_WRITEDATA, &t->sink);
+  (void)curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, t->error);
   if (curl_multi_add_handle(multi_.get(), curl) != CURLM_OK) {
-    drop_partial_file(t);
+    t->failure = "the transfer could not start";
+    t->sink.file.reset();
     give_back(curl);
     return false;
   }
@@ -187,8 +223,7 @@ void IconFetcher::run(const std::vector<IconTransfer*>& transfers) {
       CURL* curl = found->first;
       IconTransfer* t = found->second;
       running_.erase(found);
-      t->ok = finish_transfer(curl, &t->sink, msg->data.result);
-      drop_partial_file(t);
+      t->ok = finish_transfer(curl, t, msg->data.result);
       (void)curl_multi_remove_handle(multi_.get(), curl);
       give_back(curl);
     }
@@ -198,30 +233,33 @@ void IconFetcher::run(const std::vector<IconTransfer*>& transfers) {
   }
   // Left running only when the multi interface failed: those did not complete.
   for (auto& [curl, t] : running_) {
-    drop_partial_file(t);
+    t->sink.file.reset();
+    t->failure = "the transfer library failed";
     (void)curl_multi_remove_handle(multi_.get(), curl);
     give_back(curl);
   }
   running_.clear();
 }
 
-// True when the stored icon of `site_url` has this path and time stamp.
+// True when the stored icon of `site_url` has this path and time stamp and
+// its pixels are there. A row that has the texts without pixels (a file
+// written before the merge stored them only together) gets its icon again.
 bool icon_unchanged(const char* site_url, const sds_icon* icon) {
-  char* stored_path = nullptr;
-  bool same = false;
-  if (sds_get_string_for_url_from_db(site_url, &stored_path, "icon_path") == SDS_ERROR_NONE &&
-      stored_path != nullptr && icon->icon_path != nullptr &&
-      std::strcmp(stored_path, icon->icon_path) == 0) {
-    char* stored_stamp = nullptr;
-    if (sds_get_string_for_url_from_db(site_url, &stored_stamp, "image_last_updated") ==
-            SDS_ERROR_NONE &&
-        stored_stamp != nullptr && std::strcmp(stored_stamp, icon->last_modified) == 0) {
-      same = true;
+  auto stored_text = [site_url](const char* column) {
+    char* text = nullptr;
+    if (sds_get_string_for_url_from_db(site_url, &text, column) != SDS_ERROR_NONE) {
+      std::free(text);
+      text = nullptr;
     }
-    std::free(stored_stamp);
-  }
-  std::free(stored_path);
-  return same;
+    return UniqueCStr(text);
+  };
+  if (icon->icon_path == nullptr) return false;
+  UniqueCStr path = stored_text("icon_path");
+  if (!path || std::strcmp(path.get(), icon->icon_path) != 0) return false;
+  UniqueCStr stamp = stored_text("image_last_updated");
+  if (!stamp || std::strcmp(stamp.get(), icon->last_modified) != 0) return false;
+  UniqueCStr pixels = stored_text("typeof(icon_data)");
+  return pixels && std::strcmp(pixels.get(), "blob") == 0;
 }
 
 void drop_icons(sds_item* item) {
@@ -315,6 +353,10 @@ int sds_get_sitedeck_icons(sds_item** head) {
   for (auto& [item, transfer] : pending) {
     if (!transfer->ok) {
       SDS_LOGE("[CRITICAL]  Failed to Download the Icon");
+      // The item's own icon: a shared transfer's icon may be gone with an earlier item.
+      const char* icon_url = item->ps_sds_icon_list->icon_path;
+      SDS_LOGE("icon %s of %s not stored: %s", icon_url != nullptr ? icon_url : "(none)",
+               item->site_url != nullptr ? item->site_url : "(no URL)", transfer->failure.c_str());
       drop_icons(item);
       result = -1;
     }

@@ -11,6 +11,7 @@
 #include <string>
 
 #include "kdb.h"
+#include "sitedeck-service-file-write.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
@@ -39,8 +40,9 @@ struct CurlEasyDeleter {
   void operator()(CURL* c) const noexcept { curl_easy_cleanup(c); }
 };
 
-// Body chunks of one transfer: the first empties the answer file.
-bool g_first_chunk = true;
+// The answer file of the transfer in progress, written beside its name and
+// put in place once the transfer completed.
+SdsFileBeside* g_answer = nullptr;
 size_t g_answer_bytes = 0;
 
 bool present(const char* text) { return text != nullptr && text[0] != '\0'; }
@@ -107,16 +109,14 @@ size_t sds_download_xml_data(char* chunk, size_t size, size_t count, void* /*use
     sds_last_error = SDS_ERROR_SERVER_REQUEST_FAILED;
     return 0;
   }
-  std::string path = sds_path(SDS_HERE_XML_PATH);
-  UniqueFile file(std::fopen(path.c_str(), g_first_chunk ? "w+" : "a"));
-  if (!file) {
-    SDS_LOGE("Unable to open file = %s", path.c_str());
+  if (g_answer == nullptr || g_answer->get() == nullptr) {
+    SDS_LOGE("Unable to open file = %s", sds_path(SDS_HERE_XML_PATH).c_str());
     sds_last_error = SDS_ERROR_IO_ERROR;
     return bytes;
   }
-  g_first_chunk = false;
-  g_answer_bytes += std::fwrite(chunk, 1, bytes, file.get());
-  if (std::fclose(file.release()) != 0) sds_last_error = SDS_ERROR_IO_ERROR;
+  size_t written = std::fwrite(chunk, 1, bytes, g_answer->get());
+  g_answer_bytes += written;
+  if (written != bytes) sds_last_error = SDS_ERROR_IO_ERROR;
   return bytes;
 }
 
@@ -142,23 +142,46 @@ int sds_get_city_and_province(sds_server_req_args* args) {
     return sds_last_error;
   }
   CURL* c = curl.get();
+  char error_text[CURL_ERROR_SIZE] = {};
   (void)curl_easy_setopt(c, CURLOPT_URL, url.get());
+  (void)curl_easy_setopt(c, CURLOPT_ERRORBUFFER, error_text);
   (void)curl_easy_setopt(c, CURLOPT_HEADERFUNCTION, sds_parse_here_xml_header);
   (void)curl_easy_setopt(c, CURLOPT_WRITEFUNCTION, sds_download_xml_data);
   (void)curl_easy_setopt(c, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_1_1));
+  const std::string answer_path = sds_path(SDS_HERE_XML_PATH);
+  if (!sds_transfer_apply_deadline(c, SDS_TRANSFER_GEOCODER)) {
+    SDS_LOGE("geocoder not asked: the pull's deadline passed");
+    sds_last_error = SDS_ERROR_SERVER_REQUEST_FAILED;
+    return sds_last_error;
+  }
 
-  g_first_chunk = true;
+  SdsFileBeside answer(answer_path);
+  g_answer = &answer;
   g_answer_bytes = 0;
   // An answer without a body must not be read as the previous answer's file.
-  (void)std::remove(sds_path(SDS_HERE_XML_PATH).c_str());
+  (void)std::remove(answer_path.c_str());
   CURLcode performed = curl_easy_perform(c);
+  g_answer = nullptr;
+  long status = 0;
+  (void)curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &status);
+  double seconds = 0;
+  (void)curl_easy_getinfo(c, CURLINFO_TOTAL_TIME, &seconds);
   if (performed != CURLE_OK) {
     sds_last_error = SDS_ERROR_SERVER_REQUEST_FAILED;
     SDS_LOGE("[CRITICAL] Failed to perform easy perfomr[%d] \n", static_cast<int>(performed));
+    SDS_LOGE("geocoder %s failed after %.2f s: %s", geocoder_origin().c_str(), seconds,
+             error_text[0] != '\0' ? error_text : curl_easy_strerror(performed));
     return sds_last_error;
   }
   if (sds_last_error != SDS_ERROR_NONE) {
     SDS_LOGE("\nNot Parsing XML\n");
+    SDS_LOGE("geocoder %s failed after %.2f s: HTTP %ld", geocoder_origin().c_str(), seconds,
+             status);
+    return sds_last_error;
+  }
+  if (g_answer_bytes > 0 && !answer.commit()) {
+    SDS_LOGE("Unable to open file = %s", answer_path.c_str());
+    sds_last_error = SDS_ERROR_IO_ERROR;
     return sds_last_error;
   }
   sds_last_error = sds_parse_city_and_province(args);

@@ -3,8 +3,9 @@
 // regional ones, each section in document order. Member names are matched by
 // prefix (the server has sent suffixed names such as "siteUrlX" that must still
 // count), "touchIcons" alone by its whole name so that "touchIconsExists" is
-// not taken for the icon list. The list is bounded: a hostile answer cannot
-// make it grow without limit.
+// not taken for the icon list. The list is bounded: an answer past a bound
+// (items, icons of one item) is refused whole, like one that is no JSON item
+// list at all, so that a list cut short is never stored as if it were whole.
 #include <cstddef>
 #include <cstdlib>
 #include <cstring>
@@ -14,10 +15,12 @@
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-request-server.h"
 
-// Most items one answer may add to the list; the rest of the answer is ignored.
+// Most items one answer may hold.
 constexpr int SDS_MAX_ITEMS = 100000;
-// Most touch icons kept for one item; a site lists a handful.
+// Most touch icons one item may list; a site lists a handful.
 constexpr int SDS_MAX_ICONS_PER_ITEM = 64;
+
+const char* sds_item_list_refusal = nullptr;
 
 namespace {
 
@@ -49,7 +52,14 @@ constexpr MemberRule kIconRules[] = {
      sizeof(sds_icon::last_modified)},
 };
 
-enum class Walk { kGoOn, kStop };
+// kStop ends the walk keeping what was read (out of memory); kRefuse ends it
+// refusing the whole answer (sds_item_list_refusal says why).
+enum class Walk { kGoOn, kStop, kRefuse };
+
+Walk __refuse(const char* reason) {
+  sds_item_list_refusal = reason;
+  return Walk::kRefuse;
+}
 
 bool __is_number(const sds_json_node& m) {
   return m.type >= SDS_JSON_INT && m.type <= SDS_JSON_BOOLEAN;
@@ -110,9 +120,8 @@ Walk __read_icons(sds_json_node* icons, sds_item* item) {
   sds_json_node child;
   for (int i = 0; sds_json_parser_get_nth(icons, &child, i) != 0; ++i) {
     if (i == SDS_MAX_ICONS_PER_ITEM) {
-      SDS_LOGE("[CRITICAL] More than %d touch icons, the rest is ignored", SDS_MAX_ICONS_PER_ITEM);
       sds_json_parser_parse_buffer_free_value(&child);
-      break;
+      return __refuse("an item lists more than 64 touch icons");
     }
     // Appending after the known tail keeps a long icon list linear.
     sds_icon* icon =
@@ -140,7 +149,7 @@ Walk __read_body(sds_json_node* body, sds_item* item) {
       walk = __read_icons(&member, item);
     }
     sds_json_parser_parse_buffer_free_value(&member);
-    if (walk == Walk::kStop) return walk;
+    if (walk != Walk::kGoOn) return walk;
   }
   return Walk::kGoOn;
 }
@@ -154,8 +163,8 @@ Walk __read_items(sds_json_node* items, int* item_count) {
       continue;
     }
     if (*item_count >= SDS_MAX_ITEMS) {
-      SDS_LOGE("[CRITICAL] More than %d items, the rest is ignored", SDS_MAX_ITEMS);
-      return Walk::kStop;
+      sds_json_parser_parse_buffer_free_value(&element);
+      return __refuse("the list holds more than 100000 items");
     }
     sds_item* item = sds_allocate_item_memory();
     if (item == nullptr) {
@@ -164,32 +173,39 @@ Walk __read_items(sds_json_node* items, int* item_count) {
     }
     ++*item_count;
     sds_json_node body;
-    if (sds_json_parser_get_nth(&element, &body, 0) == 0) return Walk::kStop;
+    // The rest of the list could not be read: refused rather than cut short.
+    if (sds_json_parser_get_nth(&element, &body, 0) == 0) {
+      sds_json_parser_parse_buffer_free_value(&element);
+      return __refuse("an item element without a body");
+    }
     item->is_specially_removed = 0;
     Walk walk = __read_body(&body, item);
     sds_json_parser_parse_buffer_free_value(&body);
-    if (walk == Walk::kStop) return walk;
+    if (walk != Walk::kGoOn) return walk;
   }
   return Walk::kGoOn;
 }
 
-// Reads the "items" array of `parent`; false when the parse must stop.
-bool __read_items_of(sds_json_node* parent, int* item_count) {
+// Reads the "items" array of `parent`.
+Walk __read_items_of(sds_json_node* parent, int* item_count) {
   sds_json_node items;
-  if (sds_json_parser_get_member(parent, &items, "items") != 1) return true;
+  if (sds_json_parser_get_member(parent, &items, "items") != 1) return Walk::kGoOn;
   Walk walk = __read_items(&items, item_count);
   sds_json_parser_parse_buffer_free_value(&items);
-  return walk == Walk::kGoOn;
+  return walk;
 }
 
-void __read_document(sds_json_node* root) {
+// Reads the document into the global list; kRefuse when the answer must be
+// refused whole.
+Walk __read_document(sds_json_node* root) {
   {
     sds_json_node count;
     if (sds_json_parser_get_member(root, &count, "itemCount") == 1) {
       sds_json_parser_parse_buffer_free_value(&count);
     }
   }
-  if (sds_item_list_head != nullptr) return;
+  if (sds_item_list_head != nullptr) return Walk::kGoOn;
+  if (root->type != SDS_JSON_OBJECT) return __refuse("the answer is no JSON object");
 
   int item_count = 0;
   sds_json_node sections[2];
@@ -198,34 +214,48 @@ void __read_document(sds_json_node* root) {
   for (int s = 0; s < 2; ++s) {
     found[s] = sds_json_parser_get_member(root, &sections[s], names[s]) == 1;
   }
-  if (!found[0] && !found[1]) {
-    (void)__read_items_of(root, &item_count);
-    return;
-  }
-  for (int s = 0; s < 2; ++s) {
+  if (!found[0] && !found[1]) return __read_items_of(root, &item_count);
+  Walk walk = Walk::kGoOn;
+  for (int s = 0; s < 2 && walk == Walk::kGoOn; ++s) {
     if (!found[s] || sections[s].type != SDS_JSON_OBJECT) continue;
-    if (!__read_items_of(&sections[s], &item_count)) return;
+    walk = __read_items_of(&sections[s], &item_count);
   }
   for (auto& section : sections) sds_json_parser_parse_buffer_free_value(&section);
+  return walk;
+}
+
+// Refuses the answer: the list read so far goes, and the attempt fails.
+void __refuse_answer(void) {
+  SDS_LOGE("[CRITICAL] item list refused: %s", sds_item_list_refusal);
+  sds_free_item_list();
+  sds_last_error = SDS_ERROR_SERVER_REQUEST_FAILED;
 }
 
 }  // namespace
 
 void sds_parse_json_data(const char* path) {
+  sds_item_list_refusal = nullptr;
   if (path == nullptr) {
     SDS_LOGE("[CRITICAL] File path is null");
     return;
   }
+  const bool list_given = sds_item_list_head != nullptr;
   sds_json_node root;
   sds_json_parser_parse_buffer(path, &root);
   if (root.key == nullptr) {
     SDS_LOGE("[CRITICAL] parent.key is null");
+    if (!list_given) {
+      sds_item_list_refusal =
+          "the answer is no JSON document the reader accepts (malformed, larger than 4194304 "
+          "bytes, nested deeper than 64 or with too many repeated names)";
+      __refuse_answer();
+    }
     return;
   }
   if (std::strcmp(root.key, "root") != 0) {
     SDS_LOGE("[CRITICAL] Unable to find root");
-  } else {
-    __read_document(&root);
+  } else if (__read_document(&root) == Walk::kRefuse) {
+    __refuse_answer();
   }
   sds_json_parser_parse_buffer_free(&root);
 }

@@ -4,6 +4,8 @@
 // file through which the browser learns when to pull again.
 #include <curl/curl.h>
 
+#include <chrono>
+#include <climits>
 #include <cstdlib>
 #include <cstring>
 #include <mutex>
@@ -15,6 +17,7 @@
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-request-server.h"
+#include "sitedeck-service-file-write.h"
 #include "sitedeck-service-transfer-limits.h"
 #include "vconf.h"
 
@@ -27,17 +30,63 @@ constexpr long kConnectTimeoutSeconds = 65;
 // A transfer that moves less than one byte a second for this long is dead.
 constexpr long kDefaultStallSeconds = 30;
 constexpr const char* kStallSecondsKey = "db/browser/sitedeck/transfer_stall_seconds";
+constexpr const char* kTransferDeadlineKey = "db/browser/sitedeck/transfer_deadline_seconds";
+constexpr const char* kPullDeadlineKey = "db/browser/sitedeck/pull_deadline_seconds";
 
-long stall_seconds() {
+using Clock = std::chrono::steady_clock;
+// When the running pull must end; unset outside a pull.
+Clock::time_point g_pull_deadline;
+bool g_pull_running = false;
+
+// A whole number of seconds from the key, within 1..`most`; `fallback` otherwise.
+long seconds_from_key(const char* key, long most, long fallback) {
   std::string value;
-  if (kdb_read(kStallSecondsKey, &value)) {
-    long seconds = std::atol(value.c_str());
-    if (seconds > 0 && seconds <= 3600) return seconds;
+  if (kdb_read(key, &value)) {
+    char* end = nullptr;
+    long seconds = std::strtol(value.c_str(), &end, 10);
+    if (end != value.c_str() && *end == '\0' && seconds > 0 && seconds <= most) return seconds;
   }
-  return kDefaultStallSeconds;
+  return fallback;
+}
+
+long stall_seconds() { return seconds_from_key(kStallSecondsKey, 3600, kDefaultStallSeconds); }
+
+long default_deadline_seconds(sds_transfer_kind kind) {
+  switch (kind) {
+    case SDS_TRANSFER_ICON:
+      return SDS_ICON_DEADLINE_SECONDS;
+    case SDS_TRANSFER_GEOCODER:
+      return SDS_GEOCODER_DEADLINE_SECONDS;
+    case SDS_TRANSFER_ITEM_LIST:
+      break;
+  }
+  return SDS_ITEM_LIST_DEADLINE_SECONDS;
 }
 
 }  // namespace
+
+void sds_pull_deadline_start(void) {
+  const long seconds = seconds_from_key(kPullDeadlineKey, 86400, SDS_PULL_DEADLINE_SECONDS);
+  g_pull_deadline = Clock::now() + std::chrono::seconds(seconds);
+  g_pull_running = true;
+}
+
+void sds_pull_deadline_end(void) { g_pull_running = false; }
+
+long long sds_pull_ms_left(void) {
+  if (!g_pull_running) return LLONG_MAX;
+  auto left = std::chrono::duration_cast<std::chrono::milliseconds>(g_pull_deadline - Clock::now());
+  return left.count() > 0 ? left.count() : 0;
+}
+
+bool sds_transfer_apply_deadline(void* curl, sds_transfer_kind kind) {
+  long long ms = seconds_from_key(kTransferDeadlineKey, 3600, default_deadline_seconds(kind)) * 1000LL;
+  const long long pull_left = sds_pull_ms_left();
+  if (pull_left <= 0) return false;
+  if (pull_left < ms) ms = pull_left;
+  (void)curl_easy_setopt(static_cast<CURL*>(curl), CURLOPT_TIMEOUT_MS, static_cast<long>(ms));
+  return true;
+}
 
 void sds_transfer_global_init(void) {
   // libcurl's global state is process-wide and not cheap to set up; once is enough.
@@ -76,15 +125,9 @@ char* sds_get_user_agent_string(void) {
 
 void sds_set_next_update_duration(int seconds) {
   std::string path = sds_path(SDS_NEXT_UPDATE_DURATION_PATH);
-  UniqueFile file(std::fopen(path.c_str(), "w+"));
-  if (!file) {
-    SDS_LOGE("Unable to open file = %s", path.c_str());
-    sds_last_error = SDS_ERROR_IO_ERROR;
-    return;
-  }
-  std::fprintf(file.get(), "%d", seconds);
+  const std::string text = std::to_string(seconds);
   // A duration that did not reach the disk must not read as written.
-  if (std::fclose(file.release()) != 0) {
+  if (!sds_write_file_whole(path, text.data(), text.size())) {
     SDS_LOGE("Unable to open file = %s", path.c_str());
     sds_last_error = SDS_ERROR_IO_ERROR;
   }

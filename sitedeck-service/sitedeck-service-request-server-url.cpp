@@ -1,7 +1,11 @@
 // The signed item-list request URL: the server's base URL, a query describing
 // the device (country, mobile operator, platform), its city and province and
-// the browser's version, and the signature of that query. Values go in as they
-// are: the content server expects them unescaped.
+// the browser's version, and the signature of that query. In each value the
+// bytes that cannot stand in a URL query as they are (RFC 3986: space,
+// controls, '#', '%', '&', '+', '=', non-ASCII and the like) are
+// percent-encoded; every other byte goes in as it is, so a value of plain
+// letters and digits is sent exactly as before. The signature covers the
+// query as it is sent.
 #include <strings.h>
 
 #include <cstdarg>
@@ -61,6 +65,35 @@ struct QueryText {
 
 bool __present(const char* text) { return text != nullptr && text[0] != '\0'; }
 
+// True for a byte that may stand in a query value as it is: RFC 3986's
+// unreserved characters and the sub-delimiters, ':', '@', '/' and '?', less
+// the '&', '=' and '+' that give a query its structure.
+bool __query_safe(unsigned char c) {
+  if ((c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9')) return true;
+  return std::strchr("-._~!$'()*,;:@/?", c) != nullptr && c != '\0';
+}
+
+// `value` with every byte that may not stand in a query as "%XX". Owned, or
+// null when it cannot be allocated.
+char* __query_value(const char* value) {
+  static constexpr char kHex[] = "0123456789ABCDEF";
+  size_t length = std::strlen(value);
+  auto* out = static_cast<char*>(std::malloc(length * 3 + 1));
+  if (out == nullptr) return nullptr;
+  char* at = out;
+  for (const auto* p = reinterpret_cast<const unsigned char*>(value); *p != '\0'; ++p) {
+    if (__query_safe(*p)) {
+      *at++ = static_cast<char>(*p);
+    } else {
+      *at++ = '%';
+      *at++ = kHex[*p >> 4];
+      *at++ = kHex[*p & 0x0F];
+    }
+  }
+  *at = '\0';
+  return out;
+}
+
 }  // namespace
 
 char* sds_get_country_iso(void) { return vconf_get_str(VCONFKEY_CSC_COUNTRY_ISO); }
@@ -86,19 +119,27 @@ const char* sds_get_operator_code(void) {
 char* sds_get_request_url(const sds_server_data* server, const sds_server_req_args* args) {
   if (server == nullptr) return nullptr;
   QueryText query;
+  // Appends "name=value&" with the value encoded; a value that cannot be
+  // encoded fails the whole query.
+  auto add = [&query](const char* name, const char* value) {
+    UniqueCStr encoded(__query_value(value));
+    if (!encoded) {
+      query.failed = true;
+      return;
+    }
+    query.append("%s=%s&", name, encoded.get());
+  };
   {
     UniqueCStr country(sds_get_country_iso());
-    if (__present(country.get())) query.append("country=%s&", country.get());
+    if (__present(country.get())) add("country", country.get());
   }
   const char* operator_code = sds_get_operator_code();
-  if (operator_code != nullptr) query.append("operator=%s&", operator_code);
-  query.append("platform=%s&", kPlatform);
+  if (operator_code != nullptr) add("operator", operator_code);
+  add("platform", kPlatform);
   if (args != nullptr) {
-    if (__present(args->city)) query.append("city=%s&", args->city);
-    if (__present(args->province)) query.append("province=%s&", args->province);
-    if (__present(args->browser_version)) {
-      query.append("browserversion=%s&", args->browser_version);
-    }
+    if (__present(args->city)) add("city", args->city);
+    if (__present(args->province)) add("province", args->province);
+    if (__present(args->browser_version)) add("browserversion", args->browser_version);
   }
   if (server->fall_back != 0) query.append("&storage=s3");
   if (query.failed) return nullptr;

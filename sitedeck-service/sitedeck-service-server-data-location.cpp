@@ -11,6 +11,7 @@
 #include <memory>
 #include <string>
 
+#include "sitedeck-service-file-write.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
@@ -25,6 +26,10 @@ struct XmlTextWriterFree {
   void operator()(xmlTextWriter* writer) const noexcept { xmlFreeTextWriter(writer); }
 };
 using UniqueXmlTextWriter = std::unique_ptr<xmlTextWriter, XmlTextWriterFree>;
+struct XmlBufferFree {
+  void operator()(xmlBuffer* buffer) const noexcept { xmlBufferFree(buffer); }
+};
+using UniqueXmlBuffer = std::unique_ptr<xmlBuffer, XmlBufferFree>;
 
 const xmlChar* __x(const char* text) { return reinterpret_cast<const xmlChar*>(text); }
 
@@ -183,16 +188,25 @@ void save_city_and_province(const sds_server_req_args* args) {
   if (!position) return;
   if (!__present(args->city) || !__present(args->province)) return;
 
+  // Made in memory and written beside the file, then renamed over it: a
+  // reader never finds half a document, and no symlink at the name is followed.
   const std::string path = sds_path(SDS_LOCATION_INFO_PATH);
-  UniqueXmlTextWriter writer(xmlNewTextWriterFilename(path.c_str(), 0));
+  UniqueXmlBuffer buffer(xmlBufferCreate());
   int rc = -1;
-  if (writer) {
-    (void)xmlTextWriterStartDocument(writer.get(), nullptr, "UTF-8", nullptr);
-    (void)xmlTextWriterStartElement(writer.get(), __x("Location"));
-    (void)xmlTextWriterWriteElement(writer.get(), __x("LatitudeLongitude"), __x(position.get()));
-    (void)xmlTextWriterWriteElement(writer.get(), __x("City"), __x(args->city));
-    (void)xmlTextWriterWriteElement(writer.get(), __x("Province"), __x(args->province));
-    rc = xmlTextWriterEndDocument(writer.get());
+  if (buffer) {
+    UniqueXmlTextWriter writer(xmlNewTextWriterMemory(buffer.get(), 0));
+    if (writer) {
+      (void)xmlTextWriterStartDocument(writer.get(), nullptr, "UTF-8", nullptr);
+      (void)xmlTextWriterStartElement(writer.get(), __x("Location"));
+      (void)xmlTextWriterWriteElement(writer.get(), __x("LatitudeLongitude"), __x(position.get()));
+      (void)xmlTextWriterWriteElement(writer.get(), __x("City"), __x(args->city));
+      (void)xmlTextWriterWriteElement(writer.get(), __x("Province"), __x(args->province));
+      rc = xmlTextWriterEndDocument(writer.get());
+    }
+  }
+  if (rc >= 0 && !sds_write_file_whole(path, xmlBufferContent(buffer.get()),
+                                       static_cast<size_t>(xmlBufferLength(buffer.get())))) {
+    rc = -1;
   }
   if (rc < 0) {
     SDS_LOGE("|xmlTextWriterEndDocument| failed. Couldn't save city and province information");

@@ -15,6 +15,7 @@
 #include <cstring>
 #include <string>
 
+#include "sitedeck-service-file-write.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-xml-read.h"
@@ -92,21 +93,18 @@ bool __server_has_id(xmlNode* server, int id) {
 }
 
 // Replaces the file at `path` with `doc` as a whole: the document is written
-// beside it and renamed over it once it is complete on disk, so a full disk
-// or a crash in the middle leaves the old list, never a cut one (without a
-// server list no pull can run again). 0, or -1 with the old file in place.
+// beside it, synced and renamed over it once it is complete on disk, so a
+// full disk or a crash in the middle leaves the old list, never a cut one
+// (without a server list no pull can run again). 0, or -1 with the old file
+// in place.
 int __save_whole(const char* path, xmlDoc* doc) {
-  const std::string temp = std::string(path) + ".new";
-  int written = xmlSaveFileEnc(temp.c_str(), doc, "UTF-8");
-  struct stat st {};
-  bool whole = written >= 0 && stat(temp.c_str(), &st) == 0 && st.st_size == written;
-  if (whole) {
-    UniqueFd fd(open(temp.c_str(), O_RDONLY | O_CLOEXEC));
-    whole = fd && fsync(fd.get()) == 0;
-  }
-  if (!whole || rename(temp.c_str(), path) != 0) {
+  xmlChar* raw = nullptr;
+  int length = 0;
+  xmlDocDumpMemoryEnc(doc, &raw, &length, "UTF-8");
+  UniqueXmlChar text(raw);
+  if (!text || length < 0 ||
+      !sds_write_file_whole(path, text.get(), static_cast<size_t>(length), true)) {
     SDS_LOGE("[CRITICAL] %s could not be rewritten [%s]", path, strerror(errno));
-    (void)unlink(temp.c_str());
     return -1;
   }
   return 0;

@@ -6,6 +6,7 @@
 // and never keep an object with a destructor across the jump.
 #include "sitedeck-service-utils.h"
 
+#include <dirent.h>
 #include <glib.h>
 #include <limits.h>
 #include <png.h>
@@ -19,6 +20,7 @@
 
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
+#include "sitedeck-service-types.h"
 
 namespace {
 
@@ -28,9 +30,13 @@ constexpr size_t kIconHashDigits = 16;
 // hash, dash and segment stay below NAME_MAX.
 constexpr size_t kIconSegmentMax = NAME_MAX - kIconHashDigits - 1 - 8;
 // Largest image the decoder accepts: an icon is far smaller, and a PNG header
-// claiming more must not make us allocate for it.
+// claiming more must not make us allocate for it. Pixels that would not fit
+// the shared-memory object could never be handed to the browser either.
 constexpr png_uint_32 kMaxIconSide = 4096;
-constexpr size_t kMaxRawBytes = size_t{kMaxIconSide} * kMaxIconSide * 4;
+constexpr size_t kMaxRawBytes = SDS_SHM_SIZE;
+
+// Why the last decode on this thread failed, for the caller's log line.
+thread_local char t_png_failure[160];
 // Largest PNG the encoder may produce.
 constexpr size_t kMaxPngBytes = size_t{256} << 20;
 
@@ -71,7 +77,8 @@ struct png_encode_state {
   png_bytep* rows;
 };
 
-[[noreturn]] void png_error_jump(png_structp png, png_const_charp /*message*/) {
+[[noreturn]] void png_error_jump(png_structp png, png_const_charp message) {
+  (void)std::snprintf(t_png_failure, sizeof t_png_failure, "%s", message != nullptr ? message : "");
   png_longjmp(png, 1);
 }
 
@@ -118,6 +125,11 @@ int png_decode(png_decode_state* state) {
   png_read_info(png, info);
   state->width = png_get_image_width(png, info);
   state->height = png_get_image_height(png, info);
+  // Checked before anything is allocated for the pixels: a small file can
+  // claim a very large image.
+  if (size_t{state->width} * state->height * 4 > kMaxRawBytes) {
+    png_error(png, "its pixels would exceed the 3145728 bytes of the shared memory");
+  }
   int bit_depth = png_get_bit_depth(png, info);
   int color_type = png_get_color_type(png, info);
 
@@ -217,8 +229,10 @@ char* get_icon_path(const char* icon_url) {
 int convert_png_to_raw_data(const unsigned char* png, size_t png_length, unsigned char** raw_data,
                             int* width, int* height, int* size) {
   if (raw_data == nullptr || width == nullptr || height == nullptr || size == nullptr) return -1;
+  t_png_failure[0] = '\0';
   if (png == nullptr || png_length < 8 || png_sig_cmp(png, 0, 8) != 0) {
     SDS_LOGE("not recognized as a PNG");
+    (void)std::snprintf(t_png_failure, sizeof t_png_failure, "not a PNG");
     return -1;
   }
   png_decode_state state{};
@@ -247,6 +261,24 @@ int convert_png_to_raw_data(const unsigned char* png, size_t png_length, unsigne
   *height = static_cast<int>(state.height);
   *size = static_cast<int>(state.size);
   return 0;
+}
+
+const char* sds_png_failure(void) { return t_png_failure; }
+
+int sds_images_sweep(void) {
+  const std::string dir = sds_path(SDS_IMAGES_DIR);
+  DIR* raw = opendir(dir.c_str());
+  if (raw == nullptr) return 0;
+  int removed = 0;
+  const int dir_fd = dirfd(raw);
+  while (const struct dirent* entry = readdir(raw)) {
+    if (std::strcmp(entry->d_name, ".") == 0 || std::strcmp(entry->d_name, "..") == 0) continue;
+    // unlinkat removes a symlink itself, never what it points at.
+    if (unlinkat(dir_fd, entry->d_name, 0) == 0) ++removed;
+  }
+  (void)closedir(raw);
+  if (removed > 0) SDS_LOGE("%d icon files left by an earlier pull removed", removed);
+  return removed;
 }
 
 int convert_raw_data_to_png(const unsigned char* raw_data, int width, int height,

@@ -11,6 +11,12 @@ char* get_icon_path(const char* icon_url);
 // owned by the caller). Returns 0, or -1 leaving every output untouched.
 int convert_png_to_raw_data(const unsigned char* png, size_t png_length, unsigned char** raw_data,
                             int* width, int* height, int* size);
+// Why the last convert_png_to_raw_data on this thread failed: "not a PNG",
+// libpng's message, or the size refusal. Constant until the next call.
+const char* sds_png_failure(void);
+// Empties the images directory, which holds icons only while a pull stores
+// them: files a pull killed in the middle left there. Returns how many went.
+int sds_images_sweep(void);
 // Encodes B,G,R,A rows into a malloc'ed PNG. Returns 0, or -1.
 int convert_raw_data_to_png(const unsigned char* raw_data, int width, int height,
                             unsigned char** png, int* png_size);

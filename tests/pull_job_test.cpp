@@ -139,15 +139,17 @@ TEST_F(PullJob, RedirectsWithoutEndAreCappedPerPull) {
   EXPECT_EQ(sds_redirect_base_url, nullptr);
 }
 
-TEST_F(PullJob, PermanentRedirectsWithoutEndStopRewritingTheList) {
+// A 301 rewrote the server list before the new address had answered: a move
+// to an address that never answers cut the device off for good.
+TEST_F(PullJob, PermanentRedirectRewroteTheListBeforeTheNewAddressAnswered) {
   ASSERT_TRUE(a_.control({{"status", "301"}, {"location", a_.root_url() + "/v2/"}}));
   ASSERT_TRUE(write_server_list({{1, a_.base_url(), 0, 1, false}}));
+  const std::string before = server_list();
   LogCapture log;
   EXPECT_EQ(sds_check_data_pull_required(nullptr), SDS_ERROR_SERVER_REQUEST_FAILED);
   EXPECT_EQ(requests(a_), "6");
   EXPECT_TRUE(log.contains("Too many redirects (6) in one pull"));
-  EXPECT_NE(server_list().find("<Base-url>" + a_.root_url() + "/v2/SiteDeck/getSubRegionalItems<"),
-            std::string::npos);
+  EXPECT_EQ(server_list(), before);
 }
 
 TEST_F(PullJob, FirstEntryWithoutAttemptsEndsThePullUnasked) {

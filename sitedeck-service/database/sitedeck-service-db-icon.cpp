@@ -23,7 +23,9 @@ constexpr const char* kSiteDeck = "site_deck";
 constexpr long kMaxIconFileBytes = 16L << 20;
 
 // Reads and decodes the icon file at `path` into `out`; returns the code.
-int load_icon_file(const sds_icon* icon, const char* path, sds_icon_columns* out) {
+// A refused icon is logged with its site and URL.
+int load_icon_file(const char* site_url, const sds_icon* icon, const char* path,
+                   sds_icon_columns* out) {
   UniqueFile file(std::fopen(path, "rb"));
   if (!file) {
     SDS_LOGE("Failed to open file");
@@ -37,6 +39,8 @@ int load_icon_file(const sds_icon* icon, const char* path, sds_icon_columns* out
   }
   if (length > kMaxIconFileBytes) {
     SDS_LOGE("icon file too large: %ld bytes", length);
+    SDS_LOGE("icon %s of %s not stored: larger than %ld bytes", icon->icon_path, site_url,
+             kMaxIconFileBytes);
     return SDS_ERROR_IO_ERROR;
   }
   UniqueMalloc<unsigned char> png(static_cast<unsigned char*>(std::malloc(size_t(length))));
@@ -57,6 +61,7 @@ int load_icon_file(const sds_icon* icon, const char* path, sds_icon_columns* out
   if (convert_png_to_raw_data(png.get(), size_t(length), &raw_pixels, &width, &height, &size) !=
       0) {
     SDS_LOGE("some error occured while converting data");
+    SDS_LOGE("icon %s of %s not stored: %s", icon->icon_path, site_url, sds_png_failure());
     return SDS_ERROR_IO_ERROR;
   }
   out->pixels.reset(raw_pixels);
@@ -103,7 +108,7 @@ int load_item_icon(const sds_item* item, sds_icon_columns* out, UniqueCStr* path
     SDS_LOGE("NULL check::icon_path");
     return SDS_ERROR_INVALID_PARAMETER;
   }
-  return load_icon_file(icon, path->get(), out);
+  return load_icon_file(item->site_url, icon, path->get(), out);
 }
 
 // Writes one icon column; the code replaces `code` and is logged if not 0.

@@ -75,6 +75,10 @@ int get_sitedeck_item_from_db(int id, sds_item* item);
 // SDS_MERGE_NOT_COMMITTED when it was rolled back and the table is unchanged.
 int insert_sitedeck_items_in_db(sds_item* head);
 
+// Icons the last insert_sitedeck_items_in_db could not store (not a PNG, too
+// large, unreadable): their sites have no new pixels.
+extern int sds_merge_refused_icons;
+
 // Result of insert_sitedeck_items_in_db when its transaction was rolled back
 // and the table still holds the previous list.
 constexpr int SDS_MERGE_NOT_COMMITTED = -2;

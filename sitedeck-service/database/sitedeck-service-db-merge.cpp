@@ -4,7 +4,11 @@
 // deleted. The whole merge is one transaction, so neither a reader in another
 // process nor a crash ever sees a half-merged table; within it, one item's
 // failing step does not stop the others, but a row that could not be written
-// makes the whole merge roll back.
+// makes the whole merge roll back. SQLite rolls the transaction back by
+// itself after some failures (a full disk, an I/O error); the merge stops at
+// the first statement that finds it gone, for every statement after it would
+// commit on its own. An icon's path, time stamp and size are stored only
+// together with its pixels, so that a broken icon is fetched again next time.
 #include <sqlite3.h>
 #include <unistd.h>
 
@@ -19,6 +23,7 @@
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
+#include "sitedeck-service-request-server.h"
 #include "sitedeck-service-utils.h"
 
 namespace {
@@ -30,6 +35,9 @@ bool run(const char* sql) {
   SDS_LOGE("%s failed: %s", sql, sqlite3_errmsg(sds_db_handle));
   return false;
 }
+
+// False once SQLite has rolled the merge's transaction back by itself.
+bool transaction_alive() { return sqlite3_get_autocommit(sds_db_handle) == 0; }
 
 // Pass 1 for one item: insert or refresh its row. `order` is its number.
 // The columns that the single-column accessors would write one after
@@ -48,17 +56,23 @@ bool merge_item(sds_item* item, int order) {
   bool written = true;
   int id = sds_db_check_duplicated_string(sds_db_handle, "site_deck", "url", item->site_url, &code);
   const bool stored = id >= 0;
+  sds_icon_columns icon;
+  const bool icon_loaded = sds_load_sitedeck_icon_columns(item, &icon) == SDS_ERROR_NONE;
+  if (!icon_loaded && item->ps_sds_icon_list != nullptr) ++sds_merge_refused_icons;
   if (!stored) {
+    // A new row takes the icon's texts only with the pixels, which the
+    // update below writes: without them the next pull fetches the icon again.
+    sds_icon* icons = item->ps_sds_icon_list;
+    item->ps_sds_icon_list = nullptr;
     id = sds_db_create_site_deck_item(sds_db_handle, item, &code);
+    item->ps_sds_icon_list = icons;
     written = id > 0;
   }
+  if (!transaction_alive()) return false;
 
-  sds_icon_columns icon;
   sds_db_column_value values[SDS_ICON_COLUMNS_MAX + 4];
   int count = 0;
-  if (sds_load_sitedeck_icon_columns(item, &icon) == SDS_ERROR_NONE) {
-    count = sds_icon_columns_values(icon, values);
-  }
+  if (icon_loaded) count = sds_icon_columns_values(icon, values);
   values[count++] = {"order_index", &order, 0, SDS_DB_COLUMN_TYPE_INT};
   if (stored) {
     if (item->site_name != nullptr) {
@@ -99,7 +113,7 @@ struct IconFileSweep {
 bool collect_urls(const sds_item* head, UrlSet* urls) {
   try {
     for (const sds_item* item = head; item != nullptr; item = item->next) {
-      if (item->site_url != nullptr) urls->insert(item->site_url);
+      if (sds_item_is_usable(item)) urls->insert(item->site_url);
     }
     return true;
   } catch (const std::bad_alloc&) {
@@ -139,15 +153,22 @@ int delete_vanished(const sds_item* head) {
       SDS_LOGE("Not able to delete one URL");
       code = SDS_ERROR_IO_ERROR;
     }
+    if (!transaction_alive()) return SDS_ERROR_IO_ERROR;
   }
   return code;
 }
 
 }  // namespace
 
+int sds_merge_refused_icons = 0;
+
 int insert_sitedeck_items_in_db(sds_item* head) {
-  // An empty list would make pass 2 delete every live site.
-  if (head == nullptr) {
+  sds_merge_refused_icons = 0;
+  // An empty list, or one without a site the deck may hold, would make pass 2
+  // delete every live site.
+  const sds_item* usable = head;
+  while (usable != nullptr && !sds_item_is_usable(usable)) usable = usable->next;
+  if (usable == nullptr) {
     SDS_LOGE("NULL check::item");
     return SDS_MERGE_NOT_COMMITTED;
   }
@@ -158,16 +179,17 @@ int insert_sitedeck_items_in_db(sds_item* head) {
 
   int order = 1;
   bool rows_written = true;
-  for (sds_item* item = head; item != nullptr; item = item->next) {
-    if (item->site_url == nullptr || item->site_url[0] == '\0') continue;
+  for (sds_item* item = head; item != nullptr && transaction_alive(); item = item->next) {
+    if (!sds_item_is_usable(item)) continue;
     rows_written = merge_item(item, order) && rows_written;
     ++order;
   }
-  int code = delete_vanished(head);
+  int code = transaction_alive() ? delete_vanished(head) : SDS_ERROR_IO_ERROR;
 
   // SQLite rolls a transaction back by itself after some errors (a full disk,
-  // an I/O error); then there is nothing left to commit.
-  if (sqlite3_get_autocommit(sds_db_handle) != 0) {
+  // an I/O error); then there is nothing left to commit, and the table is as
+  // it was before the merge.
+  if (!transaction_alive()) {
     SDS_LOGE("merge transaction was rolled back");
     return SDS_MERGE_NOT_COMMITTED;
   }

@@ -24,6 +24,7 @@ bool step_write(sqlite3* handle, sqlite3_stmt* stmt, int* error_code) {
   int rc = sqlite3_step(stmt);
   SDS_LOGE("Before write finalize, sqlite response code %d", rc);
   if (rc == SQLITE_DONE) return true;
+  sds_db_log_failure(handle, "a write");
   *error_code = sds_db_reason_or(handle, SDS_ERROR_INVALID_PARAMETER);
   return false;
 }

@@ -53,26 +53,21 @@ void configure_connection(sqlite3* db) {
   (void)sqlite3_exec(db, kMapFileForReads, nullptr, nullptr, nullptr);
 }
 
-// SQLite opens files lazily: a file that is not a database is only noticed
-// at the first statement. Reading the schema version makes that happen now.
-// Returns SQLITE_OK or the result of the failing call.
-int probe_database(sqlite3* db) {
-  sqlite3_stmt* raw = nullptr;
-  int rc = sqlite3_prepare_v2(db, "PRAGMA schema_version", -1, &raw, nullptr);
-  SqliteStmt stmt(raw);
-  if (rc != SQLITE_OK) return rc;
-  rc = sqlite3_step(stmt.get());
-  return rc == SQLITE_ROW || rc == SQLITE_DONE ? SQLITE_OK : rc;
-}
-
-// True when the file holds no schema at all: an empty file, as a creation
-// that could not write its table (a full disk, a crash) leaves it.
-bool has_no_schema(sqlite3* db) {
+// SQLite opens files lazily: a file that is not a database, or whose first
+// page (the schema) is damaged, is only noticed at the first statement.
+// Reading the schema makes that happen now; the header alone would not.
+// Returns SQLITE_OK or the result of the failing call; `*tables` gets the
+// number of schema entries (0 for an empty file, as a creation that could not
+// write its table, a full disk or a crash, leaves it).
+int probe_database(sqlite3* db, int* tables) {
   sqlite3_stmt* raw = nullptr;
   int rc = sqlite3_prepare_v2(db, "SELECT count(*) FROM sqlite_master", -1, &raw, nullptr);
   SqliteStmt stmt(raw);
-  return rc == SQLITE_OK && sqlite3_step(stmt.get()) == SQLITE_ROW &&
-         sqlite3_column_int(stmt.get(), 0) == 0;
+  if (rc != SQLITE_OK) return rc;
+  rc = sqlite3_step(stmt.get());
+  if (rc != SQLITE_ROW) return rc == SQLITE_DONE ? SQLITE_OK : rc;
+  *tables = sqlite3_column_int(stmt.get(), 0);
+  return SQLITE_OK;
 }
 
 // The stored ETag names the list in the table. A table without rows (just
@@ -144,7 +139,16 @@ bool sds_db_is_sound(sqlite3* handle) {
 }
 
 void sds_db_discard(sqlite3* handle) {
-  if (handle != nullptr) (void)sqlite3_close_v2(handle);
+  if (handle != nullptr) {
+    // Kept statements would keep the connection, and the deleted file, open
+    // behind a close; the rows kept from it describe a file that is gone.
+    sds_db_drop_kept_statements(handle);
+    if (sqlite3_close(handle) != SQLITE_OK) {
+      SDS_LOGE("database %s: close failed: %s", sds_path(SDS_DB_PATH).c_str(),
+               sqlite3_errmsg(handle));
+      (void)sqlite3_close_v2(handle);
+    }
+  }
   delete_database_file(sds_path(SDS_DB_PATH).c_str());
 }
 
@@ -154,13 +158,14 @@ int __db_open(const char* path, sqlite3** handle, int* error_code) {
   int rc = sqlite3_open_v2(path, &db, SQLITE_OPEN_READWRITE, nullptr);
   if (rc == SQLITE_OK) {
     configure_connection(db);
-    rc = probe_database(db);
+    int tables = -1;
+    rc = probe_database(db, &tables);
     // Anything but a file that is no database (a busy lock, say) leaves the
     // file as it is: it is a database and is used unchanged.
-    if (rc != SQLITE_NOTADB && rc != SQLITE_CORRUPT) {
+    if ((rc & 0xff) != SQLITE_NOTADB && (rc & 0xff) != SQLITE_CORRUPT) {
       // A file with tables of its own is used as it is; an empty one would
       // otherwise stay without the table for good.
-      if (rc == SQLITE_OK && has_no_schema(db)) {
+      if (rc == SQLITE_OK && tables == 0) {
         g_created_table = __rebuild_site_deck_tables(db) == 0;
       }
       if (rc == SQLITE_OK) ensure_url_index(db);
@@ -171,7 +176,12 @@ int __db_open(const char* path, sqlite3** handle, int* error_code) {
     rc = sqlite3_errcode(db);
   }
   SDS_LOGE("database open error(%d):%s", rc, sqlite3_errmsg(db));
+  // A missing file is a first start, not a failure to explain.
+  if (rc != SQLITE_CANTOPEN || access(path, F_OK) == 0) {
+    SDS_LOGE("database %s: open failed: %s", path, sqlite3_errmsg(db));
+  }
 
+  rc &= 0xff;
   if (rc == SQLITE_CORRUPT || rc == SQLITE_NOTADB) {
     (void)sqlite3_close(db);
     db = nullptr;
@@ -279,6 +289,13 @@ int sds_db_get_errorcode(sqlite3* handle) {
     default:
       return SDS_ERROR_NONE;
   }
+}
+
+void sds_db_log_failure(sqlite3* handle, const char* what) {
+  const char* file = handle != nullptr ? sqlite3_db_filename(handle, "main") : nullptr;
+  SDS_LOGE("database %s: %s failed: %s",
+           file != nullptr && file[0] != '\0' ? file : sds_path(SDS_DB_PATH).c_str(), what,
+           handle != nullptr ? sqlite3_errmsg(handle) : "no connection");
 }
 
 void __db_finalize(sqlite3_stmt* stmt) {

@@ -46,6 +46,9 @@ bool sds_db_is_sound(sqlite3* handle);
 // database found damaged; the next sds_db_open creates it afresh.
 void sds_db_discard(sqlite3* handle);
 int __db_open(const char* path, sqlite3** handle, int* error_code);
+// Logs, for a person to act on, which database file failed at `what` and
+// SQLite's own message for the connection's last failure.
+void sds_db_log_failure(sqlite3* handle, const char* what);
 int __rebuild_site_deck_tables(sqlite3* handle);
 int __check_table(sqlite3* handle, const char* table);
 void sds_db_close(sqlite3* handle);
