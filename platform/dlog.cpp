@@ -1,5 +1,6 @@
-// Log stand-in: one line per call on standard error, optionally mirrored to the
-// systemd journal with structured fields, and to a test sink.
+// Log stand-in: one line per call, on standard error or, when standard error is
+// the systemd journal's stream, straight to the journal with structured fields
+// (the stream would file the same line a second time); and to a test sink.
 #include "dlog.h"
 
 #include <dlfcn.h>
@@ -71,7 +72,8 @@ journal_send_fn journal_send() {
 
 // The service formats lines as "file: function(line) > message"; pull the three
 // code fields back out for the journal.
-void send_to_journal(int prio, const char* tag, const std::string& text) {
+// True when the line reached the journal.
+bool send_to_journal(int prio, const char* tag, const std::string& text) {
   std::string file, func, line;
   size_t colon = text.find(": ");
   size_t paren = colon == std::string::npos ? std::string::npos : text.find('(', colon);
@@ -82,10 +84,10 @@ void send_to_journal(int prio, const char* tag, const std::string& text) {
     line = text.substr(paren + 1, close - paren - 1);
   }
   journal_send_fn send = journal_send();
-  if (send == nullptr) return;
-  (void)send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journal_priority(prio),
-                        "SYSLOG_IDENTIFIER=%s", tag, "CODE_FILE=%s", file.c_str(),
-                        "CODE_LINE=%s", line.c_str(), "CODE_FUNC=%s", func.c_str(), nullptr);
+  if (send == nullptr) return false;
+  return send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journal_priority(prio),
+              "SYSLOG_IDENTIFIER=%s", tag, "CODE_FILE=%s", file.c_str(), "CODE_LINE=%s",
+              line.c_str(), "CODE_FUNC=%s", func.c_str(), nullptr) >= 0;
 }
 
 }  // namespace
@@ -115,7 +117,8 @@ int __dlog_print(log_id_t /*log_id*/, int prio, const char* tag, const char* fmt
   // A message's own line feed ends the line; it must not add a blank one.
   if (!text.empty() && text.back() == '\n') text.pop_back();
 
-  if (!g_quiet.load(std::memory_order_relaxed)) {
+  static const bool journal = stderr_is_journal();
+  if (!g_quiet.load(std::memory_order_relaxed) && !(journal && send_to_journal(prio, tag, text))) {
     std::string line;
     line.reserve(text.size() + std::strlen(tag) + 5);
     line += priority_letter(prio);
@@ -126,8 +129,6 @@ int __dlog_print(log_id_t /*log_id*/, int prio, const char* tag, const char* fmt
     line += '\n';
     // One write per line keeps lines of the two threads from interleaving.
     (void)!write(STDERR_FILENO, line.data(), line.size());
-    static const bool journal = stderr_is_journal();
-    if (journal) send_to_journal(prio, tag, text);
   }
 
   std::lock_guard<std::mutex> guard(g_sink_mutex);

@@ -1,6 +1,7 @@
 // Stand-in for the platform log service. Each call writes one line to standard
 // error, "<P>/<tag>: <formatted text>", P being I, W or E; when standard error
-// is the systemd journal the line also goes there with structured fields.
+// is the systemd journal the line goes to the journal instead, with structured
+// fields, once.
 #pragma once
 
 #include <cstdarg>

@@ -243,6 +243,9 @@ TEST_F(FaultInjection, DatabaseFileOfGarbageIsRebuiltAndTheNextPullRefillsIt) {
       {"random bytes", noise, true},
       {"a database header over random pages", database.substr(0, 100) + noise, true},
       {"a database cut after its first page", database.substr(0, 4096), true},
+      // The header alone looked sound: the damaged schema went unnoticed.
+      {"the schema on the first page overwritten",
+       database.substr(0, 100) + noise.substr(0, 3996) + database.substr(4096), true},
       {"an empty file", "", true},
       {"a page in the middle overwritten",
        database.substr(0, 8192) + noise.substr(0, 4096) + database.substr(12288), false},

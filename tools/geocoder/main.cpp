@@ -36,6 +36,10 @@ const std::vector<geo_place>& places() {
       {"-25.747900,28.229300",
        {{"Tshwane, Gauteng", "Tshwane", "Gauteng"}, {"Pretoria, Gauteng", "Pretoria", "Gauteng"}}},
       {"51.507400,-0.127800", {{"Westminster", nullptr, "England"}}},
+      // Names with spaces and with a letter beyond ASCII, as real places have.
+      {"-33.924900,18.424100",
+       {{"City of Cape Town, Western Cape", "City of Cape Town", "Western Cape"}}},
+      {"-23.550500,-46.633300", {{"S\u00e3o Paulo", "S\u00e3o Paulo", "S\u00e3o Paulo"}}},
   };
   return kPlaces;
 }
