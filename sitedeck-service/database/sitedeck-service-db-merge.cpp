@@ -174,23 +174,29 @@ int insert_sitedeck_items_in_db(sds_item* head) {
   }
   IconFileSweep sweep{head};
   if (!run("BEGIN IMMEDIATE")) return SDS_MERGE_NOT_COMMITTED;
-  // Every item runs the same few statements: prepare each once.
-  SdsDbStatementScope statements(sds_db_handle);
-
-  int order = 1;
   bool rows_written = true;
-  for (sds_item* item = head; item != nullptr && transaction_alive(); item = item->next) {
-    if (!sds_item_is_usable(item)) continue;
-    rows_written = merge_item(item, order) && rows_written;
-    ++order;
+  int code = SDS_ERROR_IO_ERROR;
+  {
+    // Every item runs the same few statements: prepare each once.
+    SdsDbStatementScope statements(sds_db_handle);
+    int order = 1;
+    for (sds_item* item = head; item != nullptr && transaction_alive(); item = item->next) {
+      if (!sds_item_is_usable(item)) continue;
+      rows_written = merge_item(item, order) && rows_written;
+      ++order;
+    }
+    if (transaction_alive()) code = delete_vanished(head);
   }
-  int code = transaction_alive() ? delete_vanished(head) : SDS_ERROR_IO_ERROR;
 
   // SQLite rolls a transaction back by itself after some errors (a full disk,
   // an I/O error); then there is nothing left to commit, and the table is as
   // it was before the merge.
   if (!transaction_alive()) {
     SDS_LOGE("merge transaction was rolled back");
+    // With every statement of the merge finalized, the next read lets SQLite
+    // finish the rollback and remove its journal, instead of leaving a hot
+    // journal on the full disk for whoever opens the file next.
+    (void)sqlite3_exec(sds_db_handle, "SELECT count(*) FROM site_deck", nullptr, nullptr, nullptr);
     return SDS_MERGE_NOT_COMMITTED;
   }
   // With no live row there is nothing to clean up and the merge is whole,
