@@ -65,13 +65,18 @@ int _sds_get_string(int sock, int item_id, const char* column) {
   char* text = nullptr;
   int code = sds_get_string_from_db(item_id, &text, column);
   UniqueCStr owned(text);
-  if (code == SDS_ERROR_NONE && owned) {
-    size_t length = std::strlen(owned.get());
+  size_t length = owned ? std::strlen(owned.get()) : 0;
+  // A string item carries 1 to SDS_IPC_STRING_MAX bytes. Status 0 without
+  // the string would leave the browser waiting for it, or reading its next
+  // reply as the string; such a text counts as not stored.
+  if (code == SDS_ERROR_NONE && (length == 0 || length > SDS_IPC_STRING_MAX)) {
+    SDS_LOGE("[ERROR] %s of id:%d is %zu bytes, not sendable as a string", column, item_id, length);
+    code = SDS_ERROR_NO_DATA;
+  }
+  if (code == SDS_ERROR_NONE) {
     const int32_t status = SDS_ERROR_NONE;
     const auto wire_length = static_cast<int32_t>(length);
-    // A text the string item can't carry goes the long way, which refuses it.
-    if (length > 0 && length <= SDS_IPC_STRING_MAX &&
-        __sds_reply_at_once(sock, {__sds_item(&status, sizeof status),
+    if (__sds_reply_at_once(sock, {__sds_item(&status, sizeof status),
                                    __sds_item(&wire_length, sizeof wire_length),
                                    __sds_item(owned.get(), length)})) {
       return code;

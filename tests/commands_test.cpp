@@ -38,9 +38,10 @@ constexpr int kBigWidth = 1024;
 constexpr int kBigHeight = 769;
 
 const std::string kLongUrl = "https://four.example/" + std::string(5000 - 21, 'u');
+const std::string kLongTitle(5000, 't');
 
 // Live items 2, 1, 5 in deck order; 3 withdrawn by the server; 4 with
-// is_dirty 0 and a URL the wire can't carry.
+// is_dirty 0 and a URL and title the wire can't carry.
 std::vector<SeedItem> base_deck() {
   SeedItem one = seed_item(1, "https://one.example/", "One", 2);
   one.dominant_color = "#102030";
@@ -54,7 +55,7 @@ std::vector<SeedItem> base_deck() {
   three.touch_icon_exists = 1;
   three.favicon_exists = 1;
   three.is_dirty = -1;
-  SeedItem four = seed_item(4, kLongUrl, "Four", 4);
+  SeedItem four = seed_item(4, kLongUrl, kLongTitle, 4);
   four.is_dirty = 0;
   SeedItem big = seed_item(5, "https://big.example/", "Big", 5);
   big.icon_size = "1024x769";
@@ -194,7 +195,8 @@ TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
       {"flag: status and one word", SDS_CMD_GET_TOUCH_ICON_EXISTS, 3, "", {0, 1}, ""},
       {"NULL text: status alone", SDS_CMD_GET_DOMINANT_COLOR, 3, "", {SDS_ERROR_NO_DATA}, ""},
       {"icon without pixels: status six alone", SDS_CMD_GET_ICON, 2, "", {SDS_ERROR_NO_DATA}, ""},
-      {"url over the wire limit: status zero, no string", SDS_CMD_GET_URL, 4, "", {0}, ""},
+      {"url over the wire limit: status six alone", SDS_CMD_GET_URL, 4, "", {6}, ""},
+      {"title over the wire limit: status six alone", SDS_CMD_GET_TITLE, 4, "", {6}, ""},
       {"no condition: live ids in order", SDS_CMD_GET_FULL_IDS, 0, flag6, {0, 3, 2, 1, 5}, ""},
       {"unknown selector: status five alone", SDS_CMD_GET_FULL_IDS, 0,
        std::string("\0\0\0\0\x02\0", 6), {SDS_ERROR_INVALID_PARAMETER}, ""},
@@ -209,6 +211,8 @@ TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
     EXPECT_EQ(text, c.text);
     expect_nothing_pending();
   }
+  EXPECT_TRUE(service_.has_message("[ERROR] title of id:4 is 5000 bytes, not sendable as a string"))
+      << service_.output();
 }
 
 TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
