@@ -2,7 +2,8 @@
 // scratch root whose database was seeded beforehand, spoken to through the
 // client library and, where the exact bytes matter, through the raw socket.
 // That nothing more follows a reply is shown by the next reply: a command 10
-// sent after it must come back as the very next eight bytes.
+// sent after it must come back as the very next eight bytes. Last, clients
+// that misbehave: the service must not hang on them.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
@@ -17,6 +18,7 @@
 #include <vector>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "kdb.h"
 #include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-request-handler.h"
@@ -275,6 +277,24 @@ TEST_F(DeckCommands, IconLargerThanTheSharedMemoryIsStatusTwoAndNothingIsCopied)
   EXPECT_TRUE(connection_.is_open());
 }
 
+// A client that left with requests unanswered had every item of every reply
+// written into the void, each failure logged (33,000 lines from one client).
+TEST_F(DeckCommands, RepliesToAClientThatLeftWereWrittenAndLoggedItemByItem) {
+  const sds_command title{SDS_CMD_GET_TITLE, connection_.cid(), 1};
+  const std::vector<sds_command> requests(2000, title);
+  ASSERT_TRUE(write_all(fd_, requests.data(), requests.size() * sizeof title));
+  connection_.close();
+  int status = 0;
+  ASSERT_TRUE(service_.wait_exit(&status));
+  EXPECT_EQ(exit_code_of(status), 0) << service_.output();
+  const auto messages = service_.messages();
+  EXPECT_EQ(std::count_if(messages.begin(), messages.end(),
+                          [](const std::string& m) { return m.rfind("[IPC.Write]", 0) == 0; }),
+            1)
+      << service_.output();
+  EXPECT_TRUE(service_.has_message_matching("disconnect client:[0-9]+ sock:[0-9]+"));
+}
+
 TEST_F(DeckCommands, ReleaseAnswersZeroRemovesTheObjectAndEndsTheConnection) {
   struct stat st {};
   ASSERT_EQ(stat(SDS_SHM_FILE_PATH, &st), 0);
@@ -394,6 +414,65 @@ TEST(UnopenableDatabase, DispatcherAnswersFifteenAndLeavesTheRequestDataUnread) 
             static_cast<ssize_t>(sizeof condition));
   EXPECT_EQ(std::memcmp(unread, condition, sizeof condition), 0);
   EXPECT_EQ(sds_db_handle, nullptr);
+}
+
+// Time-outs set short through the platform keys, as an integrator may.
+class ConnectionBounds : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(kdb_write("db/browser/sitedeck/request_timeout_ms", "200"));
+    ASSERT_TRUE(kdb_write("db/browser/sitedeck/reply_timeout_ms", "200"));
+    ASSERT_TRUE(service_.start_activated());
+    ASSERT_EQ(service_.connect(&connection_), SDS_ERROR_NONE) << service_.output();
+    fd_ = connection_.fd();
+  }
+  int exit_code() {
+    int status = 0;
+    return service_.wait_exit(&status) ? exit_code_of(status) : -1;
+  }
+
+  TempRoot root_;
+  ServiceHarness service_;
+  SdsConnection connection_;
+  int fd_ = -1;
+};
+
+// A request that stopped half-way held its connection, and its process, for
+// ever. Between requests the wait stays unbounded: the browser's session.
+TEST_F(ConnectionBounds, HalfSentRequestHeldTheConnectionForEver) {
+  struct pollfd idle = {fd_, POLLIN, 0};
+  EXPECT_EQ(poll(&idle, 1, 600), 0);  // three times the bound, and nothing
+  sds_command next_update{SDS_CMD_GET_NEXT_UPDATE_DURATION, connection_.cid(), 0};
+  ASSERT_TRUE(write_all(fd_, &next_update, sizeof next_update));
+  EXPECT_EQ(read_words(fd_, 2), (std::vector<int32_t>{0, SDS_DEFAULT_UPDATE_SECONDS}));
+
+  sds_command initialize{SDS_CMD_INITIALIZE, connection_.cid(), 0};
+  ASSERT_TRUE(write_all(fd_, &initialize, sizeof initialize));
+  EXPECT_EQ(read_words(fd_, 1), std::vector<int32_t>{0});  // and no position follows
+  EXPECT_TRUE(stream_ends(fd_));
+  EXPECT_EQ(exit_code(), 0) << service_.output();
+  EXPECT_TRUE(
+      service_.has_message_matching("\\[ERROR\\] cmd 1 not complete within 200 ms sock:[0-9]+"))
+      << service_.output();
+}
+
+// A client that sent requests and never read the replies blocked the
+// service's writes for ever.
+TEST_F(ConnectionBounds, UnreadRepliesHeldTheConnectionForEver) {
+  const sds_command next_update{SDS_CMD_GET_NEXT_UPDATE_DURATION, connection_.cid(), 0};
+  bool ended = false;
+  for (int sent = 0; sent < 100000 && !ended; ++sent) {
+    struct pollfd entry = {fd_, POLLOUT, 0};
+    ASSERT_EQ(poll(&entry, 1, kReadBoundMs), 1) << "neither room nor an end";
+    ended = (entry.revents & (POLLHUP | POLLERR)) != 0 ||
+            (send(fd_, &next_update, sizeof next_update, MSG_NOSIGNAL | MSG_DONTWAIT) < 0 &&
+             errno != EAGAIN);
+  }
+  EXPECT_TRUE(ended);
+  EXPECT_EQ(exit_code(), 0) << service_.output();
+  EXPECT_TRUE(service_.has_message_matching(
+      "\\[ERROR\\] reply to cmd 10 not read within 200 ms sock:[0-9]+"))
+      << service_.output();
 }
 
 }  // namespace
