@@ -112,7 +112,9 @@ int _sds_get_blob(int sock, int item_id) {
   }
   int length = 0, height = 0, width = 0;
   icon_delivery delivery;
+  sds_shm_copy_begin();
   int code = sds_copy_blob_from_db(item_id, &length, &height, &width, __sds_place_icon, &delivery);
+  bool whole = sds_shm_copy_end();
   if (code != SDS_ERROR_NONE) {
     SDS_LOGE("[CRITICAL]  No Data");
     int sent = __sds_reply_status(sock, SDS_ERROR_NO_DATA);
@@ -120,9 +122,11 @@ int _sds_get_blob(int sock, int item_id) {
   }
   if (delivery.too_big) {
     SDS_LOGE("[CRITICAL] icon of %d bytes does not fit the shared memory", length);
+  } else if (!whole) {
+    SDS_LOGE("[CRITICAL] shared memory cut short while the icon was copied");
   }
   // The icon could not be handed over; the connection goes on.
-  if (delivery.too_big || delivery.unmapped) {
+  if (delivery.too_big || delivery.unmapped || !whole) {
     return __sds_reply_status(sock, SDS_ERROR_SHM_FAILED) == SDS_ERROR_IO_ERROR ? SDS_ERROR_IO_ERROR
                                                                                 : SDS_ERROR_NONE;
   }

@@ -3,17 +3,21 @@
 // client library and, where the exact bytes matter, through the raw socket.
 // That nothing more follows a reply is shown by the next reply: a command 10
 // sent after it must come back as the very next eight bytes. Last, clients
-// that misbehave: the service must not hang on them.
+// and local processes that misbehave: the service must neither hang on them
+// nor die of them.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <signal.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -96,11 +100,17 @@ bool stream_ends(int fd) {
   return n == 0 || (n < 0 && errno == ECONNRESET);
 }
 
-// The icon bytes now at the start of the shared-memory object.
+// The icon bytes now at the start of the shared-memory object; none when it
+// is shorter than that.
 std::vector<uint8_t> shm_prefix(size_t length) {
   std::vector<uint8_t> bytes;
   int fd = shm_open(SDS_SHM_NAME, O_RDONLY, 0);
   if (fd < 0) return bytes;
+  struct stat st {};
+  if (fstat(fd, &st) != 0 || st.st_size < static_cast<off_t>(length)) {
+    (void)close(fd);
+    return bytes;
+  }
   void* address = mmap(nullptr, SDS_SHM_SIZE, PROT_READ, MAP_SHARED, fd, 0);
   (void)close(fd);
   if (address == MAP_FAILED) return bytes;
@@ -277,6 +287,27 @@ TEST_F(DeckCommands, IconLargerThanTheSharedMemoryIsStatusTwoAndNothingIsCopied)
   EXPECT_TRUE(connection_.is_open());
 }
 
+// Any local process may cut the object short (mode 0666): the next icon
+// was copied beyond its end, and the service died of SIGBUS.
+TEST_F(DeckCommands, IconAfterTheObjectWasCutShortKilledTheService) {
+  const auto pixels = seed_pixels(kIconWidth, kIconHeight, 1);
+  const std::vector<int32_t> served = {0, static_cast<int32_t>(pixels.size()), kIconWidth,
+                                       kIconHeight};
+  send_header(SDS_CMD_GET_ICON, 1);
+  ASSERT_EQ(read_words(fd_, 4), served);
+  UniqueFd object(shm_open(SDS_SHM_NAME, O_RDWR, 0));
+  ASSERT_TRUE(object);
+  ASSERT_EQ(ftruncate(object.get(), 0), 0);
+
+  send_header(SDS_CMD_GET_ICON, 1);
+  EXPECT_EQ(read_words(fd_, 4), served);
+  EXPECT_EQ(shm_prefix(pixels.size()), pixels);
+  struct stat st {};
+  ASSERT_EQ(fstat(object.get(), &st), 0);
+  EXPECT_EQ(st.st_size, static_cast<off_t>(SDS_SHM_SIZE));
+  expect_nothing_pending();
+}
+
 // A client that left with requests unanswered had every item of every reply
 // written into the void, each failure logged (33,000 lines from one client).
 TEST_F(DeckCommands, RepliesToAClientThatLeftWereWrittenAndLoggedItemByItem) {
@@ -414,6 +445,71 @@ TEST(UnopenableDatabase, DispatcherAnswersFifteenAndLeavesTheRequestDataUnread) 
             static_cast<ssize_t>(sizeof condition));
   EXPECT_EQ(std::memcmp(unread, condition, sizeof condition), 0);
   EXPECT_EQ(sds_db_handle, nullptr);
+}
+
+// Any local process may put something else at the object's name: a
+// directory, FIFO or symlink there made every handshake answer 2, for good.
+// And one that cuts the object short while icons are copied must not kill
+// the service either: a 3 MiB icon gives the cut time to come mid-copy.
+TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
+  TempRoot root;
+  SeedItem big = seed_item(1, "https://big.example/", "Big", 1);
+  big.icon_size = "1024x768";
+  big.icon_data = seed_pixels(1024, 768, 7);
+  ASSERT_TRUE(seed_deck({big}));
+  const std::vector<int32_t> served = {0, static_cast<int32_t>(SDS_SHM_SIZE), 1024, 768};
+  const std::string target = root.path("/target");
+  ASSERT_TRUE(write_file(target, "kept"));
+  struct Case {
+    const char* name;
+    std::function<int()> make;  // 0 when it stands at the name
+    bool cut_during_copies;
+  } cases[] = {
+      {"directory", [] { return mkdir(SDS_SHM_FILE_PATH, 0777); }, false},
+      {"FIFO", [] { return mkfifo(SDS_SHM_FILE_PATH, 0666); }, false},
+      {"symlink", [&] { return symlink(target.c_str(), SDS_SHM_FILE_PATH); }, false},
+      {"object cut short during copies", [] { return 0; }, true},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    ASSERT_EQ(c.make(), 0);
+    ServiceHarness service;
+    ASSERT_TRUE(service.start_activated());
+    SdsConnection connection;
+    ASSERT_EQ(service.connect(&connection), SDS_ERROR_NONE) << service.output();
+    struct stat st {};
+    ASSERT_EQ(lstat(SDS_SHM_FILE_PATH, &st), 0);
+    EXPECT_TRUE(S_ISREG(st.st_mode));
+    const sds_command icon{SDS_CMD_GET_ICON, connection.cid(), 1};
+    if (c.cut_during_copies) {
+      pid_t cutter = fork();
+      ASSERT_GE(cutter, 0);
+      if (cutter == 0) {
+        int fd = shm_open(SDS_SHM_NAME, O_RDWR, 0);
+        for (;;) (void)ftruncate(fd, 0);
+      }
+      for (int i = 0; i < 50; ++i) {
+        ASSERT_TRUE(write_all(connection.fd(), &icon, sizeof icon));
+        std::vector<int32_t> status = read_words(connection.fd(), 1);
+        ASSERT_EQ(status.size(), 1u);
+        if (status[0] == SDS_ERROR_SHM_FAILED) continue;  // cut during the copy
+        EXPECT_EQ(status[0], 0);
+        EXPECT_EQ(read_words(connection.fd(), 3),
+                  std::vector<int32_t>(served.begin() + 1, served.end()));
+      }
+      (void)kill(cutter, SIGKILL);
+      (void)waitpid(cutter, nullptr, 0);
+    }
+    ASSERT_TRUE(write_all(connection.fd(), &icon, sizeof icon));
+    EXPECT_EQ(read_words(connection.fd(), 4), served);
+    EXPECT_EQ(shm_prefix(SDS_SHM_SIZE), big.icon_data);
+    connection.close();
+    int status = 0;
+    ASSERT_TRUE(service.wait_exit(&status));
+    EXPECT_EQ(exit_code_of(status), 0) << service.output();
+    (void)shm_unlink(SDS_SHM_NAME);
+  }
+  EXPECT_EQ(read_file(target), "kept");
 }
 
 // Time-outs set short through the platform keys, as an integrator may.
