@@ -10,6 +10,7 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/mman.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -482,11 +483,20 @@ TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
     EXPECT_TRUE(S_ISREG(st.st_mode));
     const sds_command icon{SDS_CMD_GET_ICON, connection.cid(), 1};
     if (c.cut_during_copies) {
-      pid_t cutter = fork();
-      ASSERT_GE(cutter, 0);
-      if (cutter == 0) {
-        int fd = shm_open(SDS_SHM_NAME, O_RDWR, 0);
-        for (;;) (void)ftruncate(fd, 0);
+      UniqueFd object(shm_open(SDS_SHM_NAME, O_RDWR, 0));
+      ASSERT_TRUE(object);
+      // Cuts the object short over and over until the case ends, or this
+      // process does.
+      struct Cutter {
+        pid_t pid = fork();
+        ~Cutter() {
+          if (pid > 0 && kill(pid, SIGKILL) == 0) (void)waitpid(pid, nullptr, 0);
+        }
+      } cutter;
+      ASSERT_GE(cutter.pid, 0);
+      if (cutter.pid == 0) {
+        (void)prctl(PR_SET_PDEATHSIG, SIGKILL);
+        for (;;) (void)ftruncate(object.get(), 0);
       }
       for (int i = 0; i < 50; ++i) {
         ASSERT_TRUE(write_all(connection.fd(), &icon, sizeof icon));
@@ -497,8 +507,6 @@ TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
         EXPECT_EQ(read_words(connection.fd(), 3),
                   std::vector<int32_t>(served.begin() + 1, served.end()));
       }
-      (void)kill(cutter, SIGKILL);
-      (void)waitpid(cutter, nullptr, 0);
     }
     ASSERT_TRUE(write_all(connection.fd(), &icon, sizeof icon));
     EXPECT_EQ(read_words(connection.fd(), 4), served);
