@@ -113,6 +113,11 @@ int main() {
   if (sds_main_thread(context) != 0) {
     g_context.store(nullptr);
     __sds_stop(context);
+    // A worker that was started (the handshake write failed) may use its
+    // slot in the context, the main loop and the process's other state until
+    // SIGUSR1 ends the process: nothing is released or destroyed under it,
+    // exit handlers included. Same status as the return below.
+    if (context->client.thread != 0) _exit(255);
     result = -1;
   } else {
     g_main_loop_run(sds_main_loop);

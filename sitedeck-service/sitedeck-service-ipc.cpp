@@ -4,8 +4,10 @@
 // socket or decide about the connection, which is the caller's business.
 #include "sitedeck-service-ipc.h"
 
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/uio.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -25,18 +27,80 @@ constexpr int kRecvAttempts = 3;
 
 const char* tag_or_empty(const char* tag) { return tag != nullptr ? tag : ""; }
 
-// One write of one item. send() with MSG_NOSIGNAL keeps a client process that
-// has not ignored SIGPIPE alive when the peer is gone; a descriptor that is not
-// a socket falls back to a plain write.
-ssize_t __sds_ipc_write(int sock, const void* buffer, size_t length) {
-  ssize_t written = send(sock, buffer, length, MSG_NOSIGNAL);
-  if (written < 0 && errno == ENOTSOCK) written = write(sock, buffer, length);
-  return written;
+// The bound on the request the service is serving (sds_ipc_request_begin),
+// kept per thread: only the thread serving the connection reads and writes it.
+struct request_bound {
+  int sock = -1;
+  struct timespec deadline {};
+  int failure = 0;         // errno of the first failure; 0 while none
+  bool timed_out = false;  // a read found the time up: nothing more is read
+};
+thread_local request_bound tl_bound;
+
+request_bound* __sds_bound_of(int sock) {
+  return sock >= 0 && tl_bound.sock == sock ? &tl_bound : nullptr;
+}
+
+void __sds_ipc_fail(request_bound* bound, int err) {
+  if (bound != nullptr && bound->failure == 0) bound->failure = err != 0 ? err : EIO;
+}
+
+// Milliseconds left until the deadline, rounded up; 0 once it has passed.
+int __sds_ms_left(const struct timespec& deadline) {
+  struct timespec now {};
+  (void)clock_gettime(CLOCK_MONOTONIC, &now);
+  long long ns = (deadline.tv_sec - now.tv_sec) * 1000000000LL + (deadline.tv_nsec - now.tv_nsec);
+  if (ns <= 0) return 0;
+  return static_cast<int>(std::min((ns + 999999) / 1000000, static_cast<long long>(INT_MAX)));
+}
+
+// Waits until the bounded socket has something to read (data, its end, an
+// error) or the request's time is up; false, with the failure noted, then.
+bool __sds_ipc_wait_readable(request_bound* bound) {
+  for (int left = __sds_ms_left(bound->deadline); left > 0; left = __sds_ms_left(bound->deadline)) {
+    struct pollfd entry = {bound->sock, POLLIN, 0};
+    int ready = poll(&entry, 1, left);
+    if (ready != 0 && !(ready < 0 && errno == EINTR)) return true;
+  }
+  __sds_ipc_fail(bound, ETIMEDOUT);
+  bound->timed_out = true;
+  return false;
+}
+
+// One item, all of it: send() with MSG_NOSIGNAL keeps a client process that
+// has not ignored SIGPIPE alive when the peer is gone; a descriptor that is
+// not a socket falls back to a plain write. A blocking socket takes the item
+// whole unless the reply time-out or a signal cut it short, and the rest of a
+// cut item must still follow. 0, or -1 with errno set.
+int __sds_ipc_write_all(int sock, const void* buffer, size_t length) {
+  const auto* next = static_cast<const char*>(buffer);
+  bool sent_any = false;
+  while (length > 0) {
+    ssize_t written = send(sock, next, length, MSG_NOSIGNAL);
+    if (written < 0 && errno == ENOTSOCK) written = write(sock, next, length);
+    if (written < 0 && errno == EINTR && sent_any) continue;
+    if (written <= 0) {
+      if (written == 0) errno = EIO;
+      return -1;
+    }
+    sent_any = true;
+    next += written;
+    length -= static_cast<size_t>(written);
+  }
+  return 0;
 }
 
 int __sds_ipc_write_item(int sock, const void* buffer, size_t length) {
-  if (__sds_ipc_write(sock, buffer, length) < 1) {
-    SDS_LOGE("[IPC.Write] exception sock:%d [%s]", sock, strerror(errno));
+  request_bound* bound = __sds_bound_of(sock);
+  if (bound != nullptr && bound->failure != 0) {
+    errno = bound->failure;
+    return -1;
+  }
+  if (__sds_ipc_write_all(sock, buffer, length) != 0) {
+    int err = errno;
+    SDS_LOGE("[IPC.Write] exception sock:%d [%s]", sock, strerror(err));
+    __sds_ipc_fail(bound, err);
+    errno = err;
     return -1;
   }
   return 0;
@@ -73,8 +137,16 @@ int sds_ipc_recv(int sock, void* buffer, size_t length, const char* tag) {
     return -1;
   }
   length = std::min(length, static_cast<size_t>(INT_MAX));
+  request_bound* bound = __sds_bound_of(sock);
   ssize_t result = -1;
   for (int attempt = 1; attempt <= kRecvAttempts; ++attempt) {
+    // A bounded request's time counts over all its reads and their retries;
+    // once it is up, nothing more is read or logged for it. (What a client
+    // that does not read its replies has already sent can still be read.)
+    if (bound != nullptr && (bound->timed_out || !__sds_ipc_wait_readable(bound))) {
+      errno = ETIMEDOUT;
+      return -1;
+    }
     result = read(sock, buffer, length);
     int code = SDS_ERROR_NONE;
     if (result < 0) {
@@ -250,26 +322,34 @@ int sds_ipc_send_custom_type(int sock, const void* buffer, size_t length) {
 
 int sds_ipc_send_reply(int sock, const struct iovec* items, int count) {
   constexpr int kMaxItems = 8;
-  if (sock < 0 || items == nullptr || count < 1 || count > kMaxItems) return 0;
+  if (sock < 0 || items == nullptr || count < 1 || count > kMaxItems) {
+    SDS_LOGE("[ERROR] check sock:%d", sock);
+    return -1;
+  }
+  request_bound* bound = __sds_bound_of(sock);
+  if (bound != nullptr && bound->failure != 0) {
+    errno = bound->failure;
+    return -1;
+  }
   struct iovec rest[kMaxItems];
   std::memcpy(rest, items, sizeof(struct iovec) * static_cast<size_t>(count));
   struct iovec* next = rest;
-  bool sent_any = false;
   while (count > 0) {
     struct msghdr message {};
     message.msg_iov = next;
     message.msg_iovlen = static_cast<size_t>(count);
     ssize_t written = sendmsg(sock, &message, MSG_NOSIGNAL);
     if (written < 0 && errno == ENOTSOCK) written = writev(sock, next, count);
-    // Once part of the reply is out, the rest must follow it.
-    if (written < 0 && errno == EINTR && sent_any) continue;
+    if (written < 0 && errno == EINTR) continue;
     if (written <= 0) {
-      if (!sent_any) return 0;
-      SDS_LOGE("[IPC.Write] exception sock:%d [%s]", sock, strerror(errno));
+      int err = written == 0 ? EIO : errno;
+      SDS_LOGE("[IPC.Write] exception sock:%d [%s]", sock, strerror(err));
+      __sds_ipc_fail(bound, err);
+      errno = err;
       return -1;
     }
-    sent_any = true;
-    // A blocking socket sends everything unless a signal cut it short.
+    // A blocking socket sends everything unless the reply time-out or a
+    // signal cut it short; the rest must follow what went out.
     auto left = static_cast<size_t>(written);
     while (count > 0 && left >= next->iov_len) {
       left -= next->iov_len;
@@ -281,7 +361,24 @@ int sds_ipc_send_reply(int sock, const struct iovec* items, int count) {
       next->iov_len -= left;
     }
   }
-  return 1;
+  return 0;
+}
+
+void sds_ipc_request_begin(int sock, int timeout_ms) {
+  tl_bound = {};
+  if (sock < 0) return;
+  tl_bound.sock = sock;
+  (void)clock_gettime(CLOCK_MONOTONIC, &tl_bound.deadline);
+  long long ns = tl_bound.deadline.tv_nsec + (std::max(timeout_ms, 0) % 1000) * 1000000LL;
+  tl_bound.deadline.tv_sec += std::max(timeout_ms, 0) / 1000 + ns / 1000000000LL;
+  tl_bound.deadline.tv_nsec = static_cast<long>(ns % 1000000000LL);
+}
+
+int sds_ipc_request_end(int sock) {
+  request_bound* bound = __sds_bound_of(sock);
+  int failure = bound != nullptr ? bound->failure : 0;
+  tl_bound = {};
+  return failure;
 }
 
 int sds_ipc_read_blob(int sock, void* buffer, size_t size) {

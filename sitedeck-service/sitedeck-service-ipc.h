@@ -3,7 +3,8 @@
 // with no framing beyond what each command implies. Both ends are here: the
 // service uses the readers and writers, a client library the client end
 // (sds_ipc_send_command, sds_ipc_simple_response, sds_ipc_read_int,
-// sds_ipc_read_blob). The primitives keep no state and never close the socket.
+// sds_ipc_read_blob). The primitives never close the socket; the only state
+// they keep is the bound the service puts on the request it is serving.
 #pragma once
 
 #include <sys/uio.h>
@@ -42,8 +43,21 @@ const char* sds_error_string(int code);
 
 // Sends the items of one reply in one system call: the same bytes, back to
 // back, that writing them one by one would put on the wire, with one wake-up
-// of the peer instead of one per item. Returns 1 when all went out; 0 when
-// nothing did, nothing being logged (the caller writes the items one by one
-// instead, each failing and logging as it does); -1 when the reply stopped
-// part-way, after "[IPC.Write] exception sock:%d [%s]".
+// of the peer instead of one per item. Returns 0 when all went out, -1 after
+// "[IPC.Write] exception sock:%d [%s]" otherwise.
 [[nodiscard]] int sds_ipc_send_reply(int sock, const struct iovec* items, int count);
+
+// Service end: bounds the request whose header has just been read on `sock`,
+// until sds_ipc_request_end. The reads of its remaining items on this thread
+// wait no longer than `timeout_ms` from this call, all together: a request
+// whose bytes stop arriving half-way does not hold the connection for ever.
+// After the first write that failed, or read that timed out, every further
+// write of `sock` fails at once and logs nothing, so that a broken reply is
+// neither continued nor logged item by item; after a time-out, reads do the
+// same. The client end never calls this; unbounded, the primitives block as
+// they always did.
+void sds_ipc_request_begin(int sock, int timeout_ms);
+// Ends the bound. Returns 0 when the request's reads and writes went
+// through, else the errno of the first failure (ETIMEDOUT: the request did
+// not arrive in time); the connection has to end then.
+int sds_ipc_request_end(int sock);

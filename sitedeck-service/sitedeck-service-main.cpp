@@ -3,7 +3,10 @@
 // creates the shared-memory object, starts the worker and sends the handshake.
 // The worker serves one request at a time until the connection ends and then
 // ends the main loop, which ends the process. Neither closes the connection
-// nor frees anything on the way out: the process exit does that.
+// nor frees anything on the way out: the process exit does that. Between
+// requests the worker waits for the client as long as it takes (that is how
+// the browser holds its session); within one, the rest of a request and the
+// reading of a reply are bounded (docs/hardening.md).
 #include "sitedeck-service-main.h"
 
 #include <glib.h>
@@ -15,9 +18,12 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
+#include <string>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "kdb.h"
 #include "sitedeck-service-default-deck.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-log.h"
@@ -30,6 +36,35 @@ namespace {
 
 // The last id handed out; only the acceptor writes it.
 int32_t g_last_client_id = 0;
+
+// Once a request's header has arrived, the rest of it must follow within this
+// time; a reply must find the client reading within this time. Long enough
+// for a slow device under load, short enough that a stuck client does not
+// keep a process (and the database) for long. Read per connection.
+constexpr int kDefaultRequestTimeoutMs = 10000;
+constexpr int kDefaultReplyTimeoutMs = 30000;
+constexpr int kMaxTimeoutMs = 600000;
+constexpr const char* kRequestTimeoutKey = "db/browser/sitedeck/request_timeout_ms";
+constexpr const char* kReplyTimeoutKey = "db/browser/sitedeck/reply_timeout_ms";
+
+// Written by the acceptor before the worker starts, read by the worker.
+int g_request_timeout_ms = kDefaultRequestTimeoutMs;
+int g_reply_timeout_ms = kDefaultReplyTimeoutMs;
+
+// A time-out key's value in milliseconds: a whole decimal number from 1 to
+// kMaxTimeoutMs, else `fallback` (logged when the key is there but unusable).
+int __sds_timeout_setting(const char* key, int fallback) {
+  std::string value;
+  if (!kdb_read(key, &value)) return fallback;
+  char* end = nullptr;
+  errno = 0;
+  long ms = std::strtol(value.c_str(), &end, 10);
+  if (errno != 0 || end == value.c_str() || *end != '\0' || ms < 1 || ms > kMaxTimeoutMs) {
+    SDS_LOGE("[ERROR] %s: not a time-out of 1 to %d ms, %d ms used", key, kMaxTimeoutMs, fallback);
+    return fallback;
+  }
+  return static_cast<int>(ms);
+}
 
 gboolean __sds_quit_loop(gpointer loop) {
   g_main_loop_quit(static_cast<GMainLoop*>(loop));
@@ -111,9 +146,17 @@ int sds_main_thread(sds_server_context* context) {
     SDS_LOGE("[CRITICAL] accept Sitedeck service was crashed ?");
     return -1;
   }
-  // No receive time-out: the worker waits for the client as long as it takes.
+  g_request_timeout_ms = __sds_timeout_setting(kRequestTimeoutKey, kDefaultRequestTimeoutMs);
+  g_reply_timeout_ms = __sds_timeout_setting(kReplyTimeoutKey, kDefaultReplyTimeoutMs);
+  // No receive time-out: the worker waits for the client as long as it takes
+  // (a request's own bound is kept by the reads). A write that finds no room
+  // for the reply time-out fails with EAGAIN, which ends the connection.
   struct timeval no_timeout {};
-  if (setsockopt(sock, SOL_SOCKET, SO_RCVTIMEO, &no_timeout, sizeof no_timeout) != 0) {
+  struct timeval reply_timeout {};
+  reply_timeout.tv_sec = g_reply_timeout_ms / 1000;
+  reply_timeout.tv_usec = (g_reply_timeout_ms % 1000) * 1000;
+  if (setsockopt(sock, SOL_SOCKET, SO_RCVTIMEO, &no_timeout, sizeof no_timeout) != 0 ||
+      setsockopt(sock, SOL_SOCKET, SO_SNDTIMEO, &reply_timeout, sizeof reply_timeout) != 0) {
     SDS_LOGE("[CRITICAL] setsockopt SO_SNDTIMEO [%s]", strerror(errno));
     (void)close(sock);
     return -1;
@@ -137,17 +180,11 @@ int sds_main_thread(sds_server_context* context) {
   (void)pthread_detach(client->thread);
 
   // The worker only reads from here on, so writing the handshake is safe.
-  // Status and id go out in one write, which wakes the client once; should
-  // that fail, they are written one by one as ever.
+  // Status and id go out in one write, which wakes the client once.
   const int32_t status = SDS_ERROR_NONE;
   const struct iovec handshake[] = {{const_cast<int32_t*>(&status), sizeof status},
                                     {&id, sizeof id}};
-  int sent = sds_ipc_send_reply(sock, handshake, 2);
-  if (sent < 0) return -1;
-  if (sent == 0) {
-    if (sds_ipc_send_errorcode(sock, SDS_ERROR_NONE) != 0) return -1;
-    if (sds_ipc_send_custom_type(sock, &id, sizeof id) != 0) return -1;
-  }
+  if (sds_ipc_send_reply(sock, handshake, 2) != 0) return -1;
   SDS_LOGW("sds_main_thread end");
   return 0;
 }
@@ -206,5 +243,18 @@ int __sds_handle_client_request(sds_client* slot) {
     slot->client_id = -1;
     return SDS_ERROR_IO_ERROR;
   }
-  return sds_handle_requests(slot, &command);
+  sds_ipc_request_begin(slot->sock, g_request_timeout_ms);
+  int result = sds_handle_requests(slot, &command);
+  int failure = sds_ipc_request_end(slot->sock);
+  if (failure == 0) return result;
+  // The request stopped half-way, or its reply could not be written: what
+  // follows on the connection would be out of step.
+  if (failure == ETIMEDOUT) {
+    SDS_LOGE("[ERROR] cmd %d not complete within %d ms sock:%d", command.cmd, g_request_timeout_ms,
+             slot->sock);
+  } else if (failure == EAGAIN) {
+    SDS_LOGE("[ERROR] reply to cmd %d not read within %d ms sock:%d", command.cmd,
+             g_reply_timeout_ms, slot->sock);
+  }
+  return SDS_ERROR_IO_ERROR;
 }

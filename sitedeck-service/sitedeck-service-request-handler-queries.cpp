@@ -1,10 +1,11 @@
 // Handlers of the browser's item queries (commands 2 to 11): each reads what
 // the command carries, asks the item store and writes the reply. The reply
 // layouts are fixed by the wire protocol (docs/protocol.md). A reply of
-// several items goes out in one write when it can: the browser waits for the
-// last item, and a write per item woke it once per item. Should that write
-// fail, the items are written one by one as before, so that a peer that has
-// gone away sees the same failures, and the log the same lines.
+// several items goes out in one write: the browser waits for the last item,
+// and a write per item woke it once per item. A reply that could not be
+// written is given up and answers SDS_ERROR_IO_ERROR, which ends the
+// connection: what a peer that has gone away, or does not read, would get
+// after it could only be out of step.
 #include <sys/uio.h>
 
 #include <cstdint>
@@ -26,14 +27,22 @@ namespace {
 // The duration file holds a short decimal number; more is not a duration.
 constexpr long kMaxDurationFileBytes = 64;
 
-// Writes a whole reply in one go. False when nothing of it could be written:
-// the caller then writes the items one by one.
-bool __sds_reply_at_once(int sock, std::initializer_list<struct iovec> items) {
-  return sds_ipc_send_reply(sock, items.begin(), static_cast<int>(items.size())) != 0;
-}
-
 struct iovec __sds_item(const void* data, size_t length) {
   return {const_cast<void*>(data), length};
+}
+
+// Writes a whole reply; `code` when it went out, SDS_ERROR_IO_ERROR when not.
+int __sds_reply(int sock, int code, std::initializer_list<struct iovec> items) {
+  if (sds_ipc_send_reply(sock, items.begin(), static_cast<int>(items.size())) != 0) {
+    return SDS_ERROR_IO_ERROR;
+  }
+  return code;
+}
+
+// A reply that is a status alone.
+int __sds_reply_status(int sock, int code) {
+  const int32_t status = code;
+  return __sds_reply(sock, code, {__sds_item(&status, sizeof status)});
 }
 
 // Command 7's way with the pixels: straight from the store into the shared
@@ -65,21 +74,21 @@ int _sds_get_string(int sock, int item_id, const char* column) {
   char* text = nullptr;
   int code = sds_get_string_from_db(item_id, &text, column);
   UniqueCStr owned(text);
-  if (code == SDS_ERROR_NONE && owned) {
-    size_t length = std::strlen(owned.get());
-    const int32_t status = SDS_ERROR_NONE;
-    const auto wire_length = static_cast<int32_t>(length);
-    // A text the string item can't carry goes the long way, which refuses it.
-    if (length > 0 && length <= SDS_IPC_STRING_MAX &&
-        __sds_reply_at_once(sock, {__sds_item(&status, sizeof status),
-                                   __sds_item(&wire_length, sizeof wire_length),
-                                   __sds_item(owned.get(), length)})) {
-      return code;
-    }
+  if (code != SDS_ERROR_NONE) return __sds_reply_status(sock, code);
+  size_t length = owned ? std::strlen(owned.get()) : 0;
+  // A string item carries 1 to SDS_IPC_STRING_MAX bytes. Status 0 without
+  // the string would leave the browser waiting for it, or reading its next
+  // reply as the string; such a text counts as not stored.
+  if (length == 0 || length > SDS_IPC_STRING_MAX) {
+    SDS_LOGE("[ERROR] %s of id:%d is %zu bytes, not sendable as a string", column, item_id, length);
+    return __sds_reply_status(sock, SDS_ERROR_NO_DATA);
   }
-  (void)sds_ipc_send_errorcode(sock, code);
-  if (code == SDS_ERROR_NONE) (void)sds_ipc_send_string(sock, owned.get());
-  return code;
+  const int32_t status = SDS_ERROR_NONE;
+  const auto wire_length = static_cast<int32_t>(length);
+  return __sds_reply(
+      sock, code,
+      {__sds_item(&status, sizeof status), __sds_item(&wire_length, sizeof wire_length),
+       __sds_item(owned.get(), length)});
 }
 
 int _sds_get_int(int sock, int item_id, const char* column) {
@@ -90,15 +99,10 @@ int _sds_get_int(int sock, int item_id, const char* column) {
   sds_db_value value{};
   value.i64 = 0;
   int code = sds_get_int_from_db(item_id, &value, column);
+  if (code != SDS_ERROR_NONE) return __sds_reply_status(sock, code);
   const int32_t status = SDS_ERROR_NONE;
-  if (code == SDS_ERROR_NONE &&
-      __sds_reply_at_once(sock, {__sds_item(&status, sizeof status),
-                                 __sds_item(&value.i32, sizeof value.i32)})) {
-    return code;
-  }
-  (void)sds_ipc_send_errorcode(sock, code);
-  if (code == SDS_ERROR_NONE) (void)sds_ipc_send_custom_type(sock, &value.i32, sizeof value.i32);
-  return code;
+  return __sds_reply(
+      sock, code, {__sds_item(&status, sizeof status), __sds_item(&value.i32, sizeof value.i32)});
 }
 
 int _sds_get_blob(int sock, int item_id) {
@@ -108,41 +112,35 @@ int _sds_get_blob(int sock, int item_id) {
   }
   int length = 0, height = 0, width = 0;
   icon_delivery delivery;
-  int code =
-      sds_copy_blob_from_db(item_id, &length, &height, &width, __sds_place_icon, &delivery);
+  sds_shm_copy_begin();
+  int code = sds_copy_blob_from_db(item_id, &length, &height, &width, __sds_place_icon, &delivery);
+  bool whole = sds_shm_copy_end();
   if (code != SDS_ERROR_NONE) {
     SDS_LOGE("[CRITICAL]  No Data");
-    (void)sds_ipc_send_errorcode(sock, SDS_ERROR_NO_DATA);
-    return code;
+    int sent = __sds_reply_status(sock, SDS_ERROR_NO_DATA);
+    return sent == SDS_ERROR_IO_ERROR ? sent : code;
   }
   if (delivery.too_big) {
     SDS_LOGE("[CRITICAL] icon of %d bytes does not fit the shared memory", length);
-    (void)sds_ipc_send_errorcode(sock, SDS_ERROR_SHM_FAILED);
-    return SDS_ERROR_NONE;
+  } else if (!whole) {
+    SDS_LOGE("[CRITICAL] shared memory cut short while the icon was copied");
   }
-  if (delivery.unmapped) {
-    (void)sds_ipc_send_errorcode(sock, SDS_ERROR_SHM_FAILED);
-    return SDS_ERROR_NONE;
+  // The icon could not be handed over; the connection goes on.
+  if (delivery.too_big || delivery.unmapped || !whole) {
+    return __sds_reply_status(sock, SDS_ERROR_SHM_FAILED) == SDS_ERROR_IO_ERROR ? SDS_ERROR_IO_ERROR
+                                                                                : SDS_ERROR_NONE;
   }
   const int32_t reply[4] = {SDS_ERROR_NONE, length, width, height};
-  if (__sds_reply_at_once(sock, {__sds_item(reply, sizeof reply)})) return SDS_ERROR_NONE;
-  if (sds_ipc_send_errorcode(sock, SDS_ERROR_NONE) == 0 &&
-      sds_ipc_send_custom_type(sock, &length, sizeof length) == 0 &&
-      sds_ipc_send_custom_type(sock, &width, sizeof width) == 0) {
-    (void)sds_ipc_send_custom_type(sock, &height, sizeof height);
-  }
-  return SDS_ERROR_NONE;
+  return __sds_reply(sock, SDS_ERROR_NONE, {__sds_item(reply, sizeof reply)});
 }
 
 int _sds_release_shm(sds_client* slot) {
   if (sds_free_shm() == 1) {
     sds_shm_drop_kept_mapping();
-    (void)sds_ipc_send_errorcode(slot->sock, SDS_ERROR_NONE);
     slot->client_id = -1;
-    return SDS_ERROR_NONE;
+    return __sds_reply_status(slot->sock, SDS_ERROR_NONE);
   }
-  (void)sds_ipc_send_errorcode(slot->sock, SDS_ERROR_SHM_FAILED);
-  return SDS_ERROR_SHM_FAILED;
+  return __sds_reply_status(slot->sock, SDS_ERROR_SHM_FAILED);
 }
 
 int _sds_get_next_update_duration(int sock) {
@@ -160,8 +158,7 @@ int _sds_get_next_update_duration(int sock) {
       UniqueCStr text(static_cast<char*>(std::calloc(static_cast<size_t>(size) + 1, 1)));
       if (!text) {
         SDS_LOGE("[Critical] calloc failed");
-        (void)sds_ipc_send_errorcode(sock, SDS_ERROR_OUT_OF_MEMORY);
-        return SDS_ERROR_OUT_OF_MEMORY;
+        return __sds_reply_status(sock, SDS_ERROR_OUT_OF_MEMORY);
       }
       std::rewind(file.get());
       if (std::fread(text.get(), 1, static_cast<size_t>(size), file.get()) > 0) {
@@ -174,10 +171,7 @@ int _sds_get_next_update_duration(int sock) {
     }
   }
   const int32_t reply[2] = {SDS_ERROR_NONE, seconds};
-  if (__sds_reply_at_once(sock, {__sds_item(reply, sizeof reply)})) return SDS_ERROR_NONE;
-  (void)sds_ipc_send_errorcode(sock, SDS_ERROR_NONE);
-  (void)sds_ipc_send_custom_type(sock, &seconds, sizeof seconds);
-  return SDS_ERROR_NONE;
+  return __sds_reply(sock, SDS_ERROR_NONE, {__sds_item(reply, sizeof reply)});
 }
 
 int _sds_get_full_ids(int sock) {
@@ -212,20 +206,13 @@ int _sds_get_full_ids(int sock) {
                                    SDS_DB_COND_TYPE_INT);
   }
   UniqueMalloc<int> owned_ids(ids);
+  if (code != SDS_ERROR_NONE) return __sds_reply_status(sock, code);
+  // A count of 0 is followed by no ids.
   const int32_t head[2] = {SDS_ERROR_NONE, count};
-  if (code == SDS_ERROR_NONE && count > 0 && owned_ids &&
-      __sds_reply_at_once(sock, {__sds_item(head, sizeof head),
-                                 __sds_item(owned_ids.get(),
-                                            static_cast<size_t>(count) * sizeof(int))})) {
-    return code;
+  if (count > 0 && owned_ids) {
+    return __sds_reply(sock, code,
+                       {__sds_item(head, sizeof head),
+                        __sds_item(owned_ids.get(), static_cast<size_t>(count) * sizeof(int))});
   }
-  (void)sds_ipc_send_errorcode(sock, code);
-  if (code == SDS_ERROR_NONE) {
-    (void)sds_ipc_send_custom_type(sock, &count, sizeof count);
-    if (count > 0 && owned_ids) {
-      (void)sds_ipc_send_custom_type(sock, owned_ids.get(),
-                                     static_cast<size_t>(count) * sizeof(int));
-    }
-  }
-  return code;
+  return __sds_reply(sock, code, {__sds_item(head, sizeof head)});
 }

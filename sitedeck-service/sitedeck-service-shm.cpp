@@ -6,6 +6,12 @@
 // The icon requests share one mapping, kept for as long as the name leads to
 // the object it maps: opening and mapping the object for every icon cost
 // several times the copy of the icon itself.
+//
+// The object is open to every local process (mode 0666), so nothing about it
+// is taken on trust: whatever stands at the name and is not a regular file is
+// replaced when the object is made, a symlink is never followed, a size cut
+// short is restored before an icon is copied, and a cut that comes during
+// the copy is caught instead of killing the service with SIGBUS.
 #include "sitedeck-service-shm.h"
 
 #include <fcntl.h>
@@ -16,7 +22,9 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <csignal>
 #include <cstdio>
+#include <cstring>
 
 #include "security-server.h"
 #include "sitedeck-service-log.h"
@@ -134,13 +142,61 @@ struct kept_mapping {
 };
 kept_mapping g_kept;
 
+// Set while command 7 copies into the kept mapping, and when that copy met a
+// cut object; read by the SIGBUS handler on the same thread.
+volatile sig_atomic_t g_copying = 0;
+volatile sig_atomic_t g_copy_cut = 0;
+struct sigaction g_previous_sigbus {};
+
+// A write beyond the end of a cut object raises SIGBUS. When it hits the kept
+// mapping during a copy, private memory takes the mapping's place, so that
+// the copy finishes and the faulting write is simply done again; any other
+// SIGBUS gets the action it had before, which the repeated fault then meets.
+void __sds_shm_on_sigbus(int signal_number, siginfo_t* info, void* /*context*/) {
+  auto* start = static_cast<char*>(g_kept.address);
+  auto* fault = static_cast<char*>(info->si_addr);
+  if (g_copying != 0 && start != nullptr && fault >= start && fault < start + SDS_SHM_SIZE &&
+      mmap(start, SDS_SHM_SIZE, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_FIXED, -1,
+           0) != MAP_FAILED) {
+    g_copy_cut = 1;
+    return;
+  }
+  (void)sigaction(signal_number, &g_previous_sigbus, nullptr);
+}
+
+void __sds_shm_catch_sigbus(void) {
+  static bool installed = false;
+  if (installed) return;
+  struct sigaction action {};
+  action.sa_sigaction = __sds_shm_on_sigbus;
+  action.sa_flags = SA_SIGINFO;
+  (void)sigemptyset(&action.sa_mask);
+  installed = sigaction(SIGBUS, &action, &g_previous_sigbus) == 0;
+}
+
 // Opens the object by name and maps all of it, logging failures as
-// sds_attach_shm does; `object` gets the object's identity.
+// sds_attach_shm does; `object` gets the object's identity. A name that
+// leads to something other than a regular file is refused (shm_open never
+// follows a symlink), and an object cut short gets its size back first:
+// writing beyond its end would raise SIGBUS.
 void* __sds_map_object(struct stat* object) {
   UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDWR, 0660));
   if (!fd) {
     __sds_log_attach_open_error(errno);
     return nullptr;
+  }
+  struct stat found {};
+  if (fstat(fd.get(), &found) != 0 || !S_ISREG(found.st_mode)) {
+    SDS_LOGE("[CRITICAL] %s is not a regular file", SDS_SHM_FILE_PATH);
+    return nullptr;
+  }
+  if (found.st_size < static_cast<off_t>(SDS_SHM_SIZE)) {
+    SDS_LOGE("[CRITICAL] %s cut to %lld bytes: size restored", SDS_SHM_FILE_PATH,
+             static_cast<long long>(found.st_size));
+    if (ftruncate(fd.get(), static_cast<off_t>(SDS_SHM_SIZE)) != 0) {
+      __sds_log_resize_error(errno);
+      return nullptr;
+    }
   }
   void* address = mmap(nullptr, SDS_SHM_SIZE, PROT_READ | PROT_WRITE, MAP_SHARED, fd.get(), 0);
   if (address == MAP_FAILED) {
@@ -150,8 +206,46 @@ void* __sds_map_object(struct stat* object) {
     __sds_log_map_error(err);
     return nullptr;
   }
-  if (object != nullptr && fstat(fd.get(), object) != 0) *object = {};
+  if (object != nullptr) *object = found;
   return address;
+}
+
+// Opens the object for sds_alloc_shm, creating it when missing. Something
+// other than a regular file at the name (a directory, FIFO, socket, or a
+// symlink, which shm_open does not follow) would make every connection fail:
+// it is removed (a symlink itself, never its target) and the object made
+// anew. On failure errno tells why.
+UniqueFd __sds_open_for_alloc(void) {
+  UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT, 0660));
+  // With fs.protected_regular set (the default on many distributions), the
+  // kernel refuses an O_CREAT open of an existing file in a sticky directory
+  // such as /dev/shm when another account owns it, root included: exactly
+  // the object of an earlier connection once handed to the browser's account.
+  // Opening the existing object without O_CREAT is allowed, and is what this
+  // call needs anyway.
+  if (!fd && errno == EACCES) fd.reset(shm_open(SDS_SHM_NAME, O_RDWR, 0660));
+  if (fd) {
+    struct stat found {};
+    if (fstat(fd.get(), &found) != 0) return UniqueFd();
+    if (S_ISREG(found.st_mode)) return fd;
+    fd.reset();
+  } else {
+    // Tell "nothing usable at the name" from "a regular file we may not open".
+    int err = errno;
+    struct stat entry {};
+    if (lstat(SDS_SHM_FILE_PATH, &entry) != 0 || S_ISREG(entry.st_mode)) {
+      errno = err;
+      return fd;
+    }
+  }
+  SDS_LOGE("[CRITICAL] %s is not a regular file: replaced", SDS_SHM_FILE_PATH);
+  if (shm_unlink(SDS_SHM_NAME) != 0 && rmdir(SDS_SHM_FILE_PATH) != 0) {
+    SDS_LOGE("[CRITICAL] %s could not be removed [%s]", SDS_SHM_FILE_PATH, strerror(errno));
+    errno = EEXIST;
+    return fd;
+  }
+  fd.reset(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT | O_EXCL, 0660));
+  return fd;
 }
 
 // Hands the object to the browser's account. A system without that account
@@ -169,14 +263,7 @@ void __sds_shm_give_to_app(int fd) {
 }  // namespace
 
 int sds_alloc_shm(void) {
-  UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT, 0660));
-  // With fs.protected_regular set (the default on many distributions), the
-  // kernel refuses an O_CREAT open of an existing file in a sticky directory
-  // such as /dev/shm when another account owns it, root included: exactly
-  // the object of an earlier connection once handed to the browser's account.
-  // Opening the existing object without O_CREAT is allowed, and is what this
-  // call needs anyway.
-  if (!fd && errno == EACCES) fd.reset(shm_open(SDS_SHM_NAME, O_RDWR, 0660));
+  UniqueFd fd = __sds_open_for_alloc();
   if (!fd) {
     __sds_log_alloc_open_error(errno);
     return 0;
@@ -208,17 +295,17 @@ void* sds_attach_shm(void) { return __sds_map_object(nullptr); }
 
 void* sds_shm_kept_mapping(void) {
   struct stat named {};
-  if (g_kept.address != nullptr && stat(SDS_SHM_FILE_PATH, &named) == 0 &&
-      named.st_dev == g_kept.device && named.st_ino == g_kept.inode) {
+  if (g_kept.address != nullptr && lstat(SDS_SHM_FILE_PATH, &named) == 0 &&
+      named.st_dev == g_kept.device && named.st_ino == g_kept.inode &&
+      named.st_size >= static_cast<off_t>(SDS_SHM_SIZE)) {
     return g_kept.address;
   }
-  // Removed or made anew by someone else: map what the name leads to now,
-  // as a fresh attach for this request would.
+  // Removed, made anew or cut short by someone else: map what the name
+  // leads to now, as a fresh attach for this request would.
   sds_shm_drop_kept_mapping();
+  __sds_shm_catch_sigbus();
   struct stat object {};
   void* address = __sds_map_object(&object);
-  // An object whose identity fstat could not tell never matches the name,
-  // so its mapping is made anew (and this one unmapped) next time.
   if (address != nullptr) g_kept = {address, object.st_dev, object.st_ino};
   return address;
 }
@@ -226,6 +313,20 @@ void* sds_shm_kept_mapping(void) {
 void sds_shm_drop_kept_mapping(void) {
   if (g_kept.address != nullptr) (void)munmap(g_kept.address, SDS_SHM_SIZE);
   g_kept = {};
+}
+
+void sds_shm_copy_begin(void) {
+  g_copy_cut = 0;
+  g_copying = 1;
+}
+
+bool sds_shm_copy_end(void) {
+  g_copying = 0;
+  if (g_copy_cut == 0) return true;
+  g_copy_cut = 0;
+  // The mapping is private memory now; the next icon maps the object again.
+  sds_shm_drop_kept_mapping();
+  return false;
 }
 
 int sds_dettach_shm(void* address) {

@@ -18,3 +18,10 @@ int sds_dettach_shm(void* address);
 void* sds_shm_kept_mapping(void);
 // Unmaps the kept mapping, after the object was removed.
 void sds_shm_drop_kept_mapping(void);
+
+// Command 7 copies into the kept mapping between these two calls. Should
+// another process cut the object short meanwhile, the copy goes on into
+// private memory instead of dying of SIGBUS; the end then returns false (the
+// object holds no whole icon) and the kept mapping is let go. Worker only.
+void sds_shm_copy_begin(void);
+[[nodiscard]] bool sds_shm_copy_end(void);

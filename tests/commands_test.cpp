@@ -2,21 +2,28 @@
 // scratch root whose database was seeded beforehand, spoken to through the
 // client library and, where the exact bytes matter, through the raw socket.
 // That nothing more follows a reply is shown by the next reply: a command 10
-// sent after it must come back as the very next eight bytes.
+// sent after it must come back as the very next eight bytes. Last, clients
+// and local processes that misbehave: the service must neither hang on them
+// nor die of them.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <signal.h>
 #include <sys/mman.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <functional>
 #include <string>
 #include <vector>
 
 #include "database/sitedeck-service-db-interface.h"
+#include "kdb.h"
 #include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-request-handler.h"
@@ -38,9 +45,10 @@ constexpr int kBigWidth = 1024;
 constexpr int kBigHeight = 769;
 
 const std::string kLongUrl = "https://four.example/" + std::string(5000 - 21, 'u');
+const std::string kLongTitle(5000, 't');
 
 // Live items 2, 1, 5 in deck order; 3 withdrawn by the server; 4 with
-// is_dirty 0 and a URL the wire can't carry.
+// is_dirty 0 and a URL and title the wire can't carry.
 std::vector<SeedItem> base_deck() {
   SeedItem one = seed_item(1, "https://one.example/", "One", 2);
   one.dominant_color = "#102030";
@@ -54,7 +62,7 @@ std::vector<SeedItem> base_deck() {
   three.touch_icon_exists = 1;
   three.favicon_exists = 1;
   three.is_dirty = -1;
-  SeedItem four = seed_item(4, kLongUrl, "Four", 4);
+  SeedItem four = seed_item(4, kLongUrl, kLongTitle, 4);
   four.is_dirty = 0;
   SeedItem big = seed_item(5, "https://big.example/", "Big", 5);
   big.icon_size = "1024x769";
@@ -93,11 +101,17 @@ bool stream_ends(int fd) {
   return n == 0 || (n < 0 && errno == ECONNRESET);
 }
 
-// The icon bytes now at the start of the shared-memory object.
+// The icon bytes now at the start of the shared-memory object; none when it
+// is shorter than that.
 std::vector<uint8_t> shm_prefix(size_t length) {
   std::vector<uint8_t> bytes;
   int fd = shm_open(SDS_SHM_NAME, O_RDONLY, 0);
   if (fd < 0) return bytes;
+  struct stat st {};
+  if (fstat(fd, &st) != 0 || st.st_size < static_cast<off_t>(length)) {
+    (void)close(fd);
+    return bytes;
+  }
   void* address = mmap(nullptr, SDS_SHM_SIZE, PROT_READ, MAP_SHARED, fd, 0);
   (void)close(fd);
   if (address == MAP_FAILED) return bytes;
@@ -194,7 +208,8 @@ TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
       {"flag: status and one word", SDS_CMD_GET_TOUCH_ICON_EXISTS, 3, "", {0, 1}, ""},
       {"NULL text: status alone", SDS_CMD_GET_DOMINANT_COLOR, 3, "", {SDS_ERROR_NO_DATA}, ""},
       {"icon without pixels: status six alone", SDS_CMD_GET_ICON, 2, "", {SDS_ERROR_NO_DATA}, ""},
-      {"url over the wire limit: status zero, no string", SDS_CMD_GET_URL, 4, "", {0}, ""},
+      {"url over the wire limit: status six alone", SDS_CMD_GET_URL, 4, "", {6}, ""},
+      {"title over the wire limit: status six alone", SDS_CMD_GET_TITLE, 4, "", {6}, ""},
       {"no condition: live ids in order", SDS_CMD_GET_FULL_IDS, 0, flag6, {0, 3, 2, 1, 5}, ""},
       {"unknown selector: status five alone", SDS_CMD_GET_FULL_IDS, 0,
        std::string("\0\0\0\0\x02\0", 6), {SDS_ERROR_INVALID_PARAMETER}, ""},
@@ -209,6 +224,8 @@ TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
     EXPECT_EQ(text, c.text);
     expect_nothing_pending();
   }
+  EXPECT_TRUE(service_.has_message("[ERROR] title of id:4 is 5000 bytes, not sendable as a string"))
+      << service_.output();
 }
 
 TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
@@ -269,6 +286,45 @@ TEST_F(DeckCommands, IconLargerThanTheSharedMemoryIsStatusTwoAndNothingIsCopied)
   EXPECT_EQ(sds_client_get_icon(connection_, 5, &big), SDS_ERROR_SHM_FAILED);
   EXPECT_FALSE(big.pixels);
   EXPECT_TRUE(connection_.is_open());
+}
+
+// Any local process may cut the object short (mode 0666): the next icon
+// was copied beyond its end, and the service died of SIGBUS.
+TEST_F(DeckCommands, IconAfterTheObjectWasCutShortKilledTheService) {
+  const auto pixels = seed_pixels(kIconWidth, kIconHeight, 1);
+  const std::vector<int32_t> served = {0, static_cast<int32_t>(pixels.size()), kIconWidth,
+                                       kIconHeight};
+  send_header(SDS_CMD_GET_ICON, 1);
+  ASSERT_EQ(read_words(fd_, 4), served);
+  UniqueFd object(shm_open(SDS_SHM_NAME, O_RDWR, 0));
+  ASSERT_TRUE(object);
+  ASSERT_EQ(ftruncate(object.get(), 0), 0);
+
+  send_header(SDS_CMD_GET_ICON, 1);
+  EXPECT_EQ(read_words(fd_, 4), served);
+  EXPECT_EQ(shm_prefix(pixels.size()), pixels);
+  struct stat st {};
+  ASSERT_EQ(fstat(object.get(), &st), 0);
+  EXPECT_EQ(st.st_size, static_cast<off_t>(SDS_SHM_SIZE));
+  expect_nothing_pending();
+}
+
+// A client that left with requests unanswered had every item of every reply
+// written into the void, each failure logged (33,000 lines from one client).
+TEST_F(DeckCommands, RepliesToAClientThatLeftWereWrittenAndLoggedItemByItem) {
+  const sds_command title{SDS_CMD_GET_TITLE, connection_.cid(), 1};
+  const std::vector<sds_command> requests(2000, title);
+  ASSERT_TRUE(write_all(fd_, requests.data(), requests.size() * sizeof title));
+  connection_.close();
+  int status = 0;
+  ASSERT_TRUE(service_.wait_exit(&status));
+  EXPECT_EQ(exit_code_of(status), 0) << service_.output();
+  const auto messages = service_.messages();
+  EXPECT_EQ(std::count_if(messages.begin(), messages.end(),
+                          [](const std::string& m) { return m.rfind("[IPC.Write]", 0) == 0; }),
+            1)
+      << service_.output();
+  EXPECT_TRUE(service_.has_message_matching("disconnect client:[0-9]+ sock:[0-9]+"));
 }
 
 TEST_F(DeckCommands, ReleaseAnswersZeroRemovesTheObjectAndEndsTheConnection) {
@@ -390,6 +446,137 @@ TEST(UnopenableDatabase, DispatcherAnswersFifteenAndLeavesTheRequestDataUnread) 
             static_cast<ssize_t>(sizeof condition));
   EXPECT_EQ(std::memcmp(unread, condition, sizeof condition), 0);
   EXPECT_EQ(sds_db_handle, nullptr);
+}
+
+// Any local process may put something else at the object's name: a
+// directory, FIFO or symlink there made every handshake answer 2, for good.
+// And one that cuts the object short while icons are copied must not kill
+// the service either: a 3 MiB icon gives the cut time to come mid-copy.
+TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
+  TempRoot root;
+  SeedItem big = seed_item(1, "https://big.example/", "Big", 1);
+  big.icon_size = "1024x768";
+  big.icon_data = seed_pixels(1024, 768, 7);
+  ASSERT_TRUE(seed_deck({big}));
+  const std::vector<int32_t> served = {0, static_cast<int32_t>(SDS_SHM_SIZE), 1024, 768};
+  const std::string target = root.path("/target");
+  ASSERT_TRUE(write_file(target, "kept"));
+  struct Case {
+    const char* name;
+    std::function<int()> make;  // 0 when it stands at the name
+    bool cut_during_copies;
+  } cases[] = {
+      {"directory", [] { return mkdir(SDS_SHM_FILE_PATH, 0777); }, false},
+      {"FIFO", [] { return mkfifo(SDS_SHM_FILE_PATH, 0666); }, false},
+      {"symlink", [&] { return symlink(target.c_str(), SDS_SHM_FILE_PATH); }, false},
+      {"object cut short during copies", [] { return 0; }, true},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    ASSERT_EQ(c.make(), 0);
+    ServiceHarness service;
+    ASSERT_TRUE(service.start_activated());
+    SdsConnection connection;
+    ASSERT_EQ(service.connect(&connection), SDS_ERROR_NONE) << service.output();
+    struct stat st {};
+    ASSERT_EQ(lstat(SDS_SHM_FILE_PATH, &st), 0);
+    EXPECT_TRUE(S_ISREG(st.st_mode));
+    const sds_command icon{SDS_CMD_GET_ICON, connection.cid(), 1};
+    if (c.cut_during_copies) {
+      UniqueFd object(shm_open(SDS_SHM_NAME, O_RDWR, 0));
+      ASSERT_TRUE(object);
+      // Cuts the object short over and over until the case ends, or this
+      // process does.
+      struct Cutter {
+        pid_t pid = fork();
+        ~Cutter() {
+          if (pid > 0 && kill(pid, SIGKILL) == 0) (void)waitpid(pid, nullptr, 0);
+        }
+      } cutter;
+      ASSERT_GE(cutter.pid, 0);
+      if (cutter.pid == 0) {
+        (void)prctl(PR_SET_PDEATHSIG, SIGKILL);
+        for (;;) (void)ftruncate(object.get(), 0);
+      }
+      for (int i = 0; i < 50; ++i) {
+        ASSERT_TRUE(write_all(connection.fd(), &icon, sizeof icon));
+        std::vector<int32_t> status = read_words(connection.fd(), 1);
+        ASSERT_EQ(status.size(), 1u);
+        if (status[0] == SDS_ERROR_SHM_FAILED) continue;  // cut during the copy
+        EXPECT_EQ(status[0], 0);
+        EXPECT_EQ(read_words(connection.fd(), 3),
+                  std::vector<int32_t>(served.begin() + 1, served.end()));
+      }
+    }
+    ASSERT_TRUE(write_all(connection.fd(), &icon, sizeof icon));
+    EXPECT_EQ(read_words(connection.fd(), 4), served);
+    EXPECT_EQ(shm_prefix(SDS_SHM_SIZE), big.icon_data);
+    connection.close();
+    int status = 0;
+    ASSERT_TRUE(service.wait_exit(&status));
+    EXPECT_EQ(exit_code_of(status), 0) << service.output();
+    (void)shm_unlink(SDS_SHM_NAME);
+  }
+  EXPECT_EQ(read_file(target), "kept");
+}
+
+// Time-outs set short through the platform keys, as an integrator may.
+class ConnectionBounds : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(kdb_write("db/browser/sitedeck/request_timeout_ms", "200"));
+    ASSERT_TRUE(kdb_write("db/browser/sitedeck/reply_timeout_ms", "200"));
+    ASSERT_TRUE(service_.start_activated());
+    ASSERT_EQ(service_.connect(&connection_), SDS_ERROR_NONE) << service_.output();
+    fd_ = connection_.fd();
+  }
+  int exit_code() {
+    int status = 0;
+    return service_.wait_exit(&status) ? exit_code_of(status) : -1;
+  }
+
+  TempRoot root_;
+  ServiceHarness service_;
+  SdsConnection connection_;
+  int fd_ = -1;
+};
+
+// A request that stopped half-way held its connection, and its process, for
+// ever. Between requests the wait stays unbounded: the browser's session.
+TEST_F(ConnectionBounds, HalfSentRequestHeldTheConnectionForEver) {
+  struct pollfd idle = {fd_, POLLIN, 0};
+  EXPECT_EQ(poll(&idle, 1, 600), 0);  // three times the bound, and nothing
+  sds_command next_update{SDS_CMD_GET_NEXT_UPDATE_DURATION, connection_.cid(), 0};
+  ASSERT_TRUE(write_all(fd_, &next_update, sizeof next_update));
+  EXPECT_EQ(read_words(fd_, 2), (std::vector<int32_t>{0, SDS_DEFAULT_UPDATE_SECONDS}));
+
+  sds_command initialize{SDS_CMD_INITIALIZE, connection_.cid(), 0};
+  ASSERT_TRUE(write_all(fd_, &initialize, sizeof initialize));
+  EXPECT_EQ(read_words(fd_, 1), std::vector<int32_t>{0});  // and no position follows
+  EXPECT_TRUE(stream_ends(fd_));
+  EXPECT_EQ(exit_code(), 0) << service_.output();
+  EXPECT_TRUE(
+      service_.has_message_matching("\\[ERROR\\] cmd 1 not complete within 200 ms sock:[0-9]+"))
+      << service_.output();
+}
+
+// A client that sent requests and never read the replies blocked the
+// service's writes for ever.
+TEST_F(ConnectionBounds, UnreadRepliesHeldTheConnectionForEver) {
+  const sds_command next_update{SDS_CMD_GET_NEXT_UPDATE_DURATION, connection_.cid(), 0};
+  bool ended = false;
+  for (int sent = 0; sent < 100000 && !ended; ++sent) {
+    struct pollfd entry = {fd_, POLLOUT, 0};
+    ASSERT_EQ(poll(&entry, 1, kReadBoundMs), 1) << "neither room nor an end";
+    ended = (entry.revents & (POLLHUP | POLLERR)) != 0 ||
+            (send(fd_, &next_update, sizeof next_update, MSG_NOSIGNAL | MSG_DONTWAIT) < 0 &&
+             errno != EAGAIN);
+  }
+  EXPECT_TRUE(ended);
+  EXPECT_EQ(exit_code(), 0) << service_.output();
+  EXPECT_TRUE(service_.has_message_matching(
+      "\\[ERROR\\] reply to cmd 10 not read within 200 ms sock:[0-9]+"))
+      << service_.output();
 }
 
 }  // namespace
