@@ -2,7 +2,7 @@
 // it, written to OUT_DIR/index.html for a person to open. It reads the deck
 // the way the browser does (the live ids in the server's order, then each
 // item's fields and pixels) and leaves the page itself to
-// sitedeck-client-page.h.
+// sitedeck-tool-page.h.
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
@@ -11,7 +11,8 @@
 #include <json-glib/json-glib.h>
 
 #include "sitedeck-client-deck.h"
-#include "sitedeck-client-page.h"
+#include "sitedeck-service-raii.h"
+#include "sitedeck-tool-page.h"
 #include "sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
@@ -73,12 +74,22 @@ int __sds_render_icon(SdsConnection& connection, sds_render_item* entry, size_t*
 
 }  // namespace
 
-bool sds_tool_render_arguments(int argc, char** argv) {
-  return argc == 1 && argv[0][0] != '\0' && argv[0][0] != '-';
+bool sds_tool_render_arguments(int argc, char** argv, std::string* problem) {
+  if (argc == 0) {
+    *problem = "OUT_DIR is missing";
+  } else if (argc > 1) {
+    *problem = std::string("unexpected argument ") + argv[1];
+  } else if (argv[0][0] == '\0' || argv[0][0] == '-') {
+    *problem = std::string("\"") + argv[0] + "\" is not a directory name";
+  } else {
+    return true;
+  }
+  return false;
 }
 
 int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
-  if (!sds_tool_render_arguments(argc, argv)) return kSdsToolUsage;
+  std::string problem;
+  if (!sds_tool_render_arguments(argc, argv, &problem)) return kSdsToolUsage;
   const char* out_dir = argv[0];
 
   // Specially removed sites are not live, so the browser's list, and this

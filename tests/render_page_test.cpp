@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "sitedeck-client-page.h"
+#include "sitedeck-tool-page.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-types.h"
 #include "support/temp_root.h"

@@ -132,6 +132,16 @@ TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
     EXPECT_EQ(result.out, "") << c.arguments[1];
   }
   EXPECT_FALSE(file_exists(root_.dir() + "/none.png"));
+
+  // The service serves one connection at a time: a second client waits in
+  // the socket's backlog without a greeting, and says so once it gives up.
+  SdsConnection first;
+  ASSERT_EQ(service_.connect(&first), SDS_ERROR_NONE);
+  ProcessResult busy = sitedeck({"--timeout", "300", "hello"});
+  EXPECT_EQ(busy.exit_code, 1);
+  EXPECT_EQ(busy.err, "sitedeck: cannot reach the site deck service at " + service_.socket_path() +
+                          ": the service is busy with another connection; it serves one "
+                          "connection at a time, try again when that one ends\n");
 }
 
 // Whole values and nulls for what is not stored; the option may follow the

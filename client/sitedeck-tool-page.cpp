@@ -1,7 +1,7 @@
 // Building the start-page preview: validation of what goes into the page
 // (colours, links, texts) and the HTML itself. Everything from the service
 // passes through sds_page_escape or a validator before it reaches the page.
-#include "sitedeck-client-page.h"
+#include "sitedeck-tool-page.h"
 
 #include <glib.h>
 
