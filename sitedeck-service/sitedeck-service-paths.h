@@ -19,6 +19,8 @@
 #define SDS_NEXT_UPDATE_DURATION_PATH SDS_SERVER_DIR "/next_update_duration"
 #define SDS_HERE_XML_PATH SDS_SERVER_DIR "/site_deck_here_xml.xml"
 #define SDS_LOCATION_INFO_PATH SDS_SERVER_DIR "/location_info.xml"
+// When the last pull ran and how it ended (docs/storage.md).
+#define SDS_LAST_PULL_PATH SDS_SERVER_DIR "/last_pull"
 // The deck installed with the service for a first start: an item list in the
 // content server's format and the icon files it names.
 #define SDS_DEFAULT_DECK_DIR SDS_DATA_DIR "/default-deck"

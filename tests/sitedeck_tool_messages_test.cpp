@@ -124,8 +124,12 @@ TEST_F(SitedeckToolMessages, AnUnreachableServiceIsNamedWithTheReasonAndExitsWit
     UniqueFd bound = c.peer >= kGone && c.peer <= kFull ? BoundSocket(socket_) : UniqueFd();
     // A backlog of 0 holds one waiting connection; the tool's is the second.
     UniqueFd waiting;
-    if (bound && c.peer != kGone) ASSERT_EQ(listen(bound.get(), 0), 0);
-    if (c.peer == kDenied) ASSERT_EQ(chmod(socket_.c_str(), 0), 0);
+    if (bound && c.peer != kGone) {
+      ASSERT_EQ(listen(bound.get(), 0), 0);
+    }
+    if (c.peer == kDenied) {
+      ASSERT_EQ(chmod(socket_.c_str(), 0), 0);
+    }
     if (c.peer == kFull) {
       waiting = UniqueFd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
       struct sockaddr_un address {};
@@ -279,6 +283,11 @@ TEST_F(SitedeckToolMessages, OutputThatCannotBeWrittenExitsWithOne) {
   EXPECT_EQ(result.out, "1\n");
   EXPECT_EQ(result.err, "sitedeck: write error: No space left on device\n");
   EXPECT_EQ(run_process({tool, "--version"}).out, "sitedeck " SITEDECK_VERSION "\n");
+  const std::string service = std::string(SITEDECK_BIN_DIR) + "/browser-sitedeck-service";
+  EXPECT_EQ(run_process({service, "--version"}).out,
+            "browser-sitedeck-service " SITEDECK_VERSION "\n");
+  EXPECT_NE(run_process({service, "--help"}).out.find("started by its socket unit"),
+            std::string::npos);
 }
 
 }  // namespace
