@@ -30,12 +30,28 @@ std::string __flags(const sds_client_item& item) {
   return flags.empty() ? kMissing : flags;
 }
 
-// A flag member: its value when the service had one, else null.
+// A flag member: true or false when the service had one, else null.
 void __json_flag(JsonBuilder* builder, const char* name, int status, int32_t value) {
   if (status == SDS_ERROR_NONE) {
-    sds_tool_json_int(builder, name, value);
+    sds_tool_json_bool(builder, name, value != 0);
   } else {
     sds_tool_json_null(builder, name);
+  }
+}
+
+// The icon size as the service stores it ("WIDTHxHEIGHT") and, when it is
+// one, its two numbers beside it; null members otherwise.
+void __json_icon_size(JsonBuilder* builder, const SdsClientText& size) {
+  sds_tool_json_text(builder, "icon_size", size.get());
+  int width = 0, height = 0;
+  char tail = '\0';
+  if (size && std::sscanf(size.get(), "%dx%d%c", &width, &height, &tail) == 2 && width > 0 &&
+      height > 0) {
+    sds_tool_json_int(builder, "icon_width", width);
+    sds_tool_json_int(builder, "icon_height", height);
+  } else {
+    sds_tool_json_null(builder, "icon_width");
+    sds_tool_json_null(builder, "icon_height");
   }
 }
 
@@ -45,7 +61,7 @@ void __json_item_fields(JsonBuilder* builder, const sds_client_item& item) {
   sds_tool_json_text(builder, "url", item.url.get());
   sds_tool_json_text(builder, "title", item.title.get());
   sds_tool_json_text(builder, "dominant_color", item.dominant_color.get());
-  sds_tool_json_text(builder, "icon_size", item.icon_size.get());
+  __json_icon_size(builder, item.icon_size);
   __json_flag(builder, "touch_icon_exists", item.touch_icon_status, item.touch_icon_exists);
   __json_flag(builder, "favicon_exists", item.favicon_status, item.favicon_exists);
 }

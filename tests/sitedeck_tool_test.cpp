@@ -149,10 +149,12 @@ TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
 TEST_F(SitedeckTool, JsonOfListAndShowHasEveryFieldWithNullsForWhatIsNotStored) {
   const std::string news =
       R"({"id": 7, "url": "https://news.example/", "title": "News", "dominant_color": "#AA0000",
-          "icon_size": "4x3", "touch_icon_exists": 1, "favicon_exists": 1)";
+          "icon_size": "4x3", "icon_width": 4, "icon_height": 3, "touch_icon_exists": true,
+          "favicon_exists": true)";
   const std::string mail =
       R"({"id": 3, "url": "https://mail.example/inbox", "title": "Mail", "dominant_color": null,
-          "icon_size": null, "touch_icon_exists": 0, "favicon_exists": 0)";
+          "icon_size": null, "icon_width": null, "icon_height": null,
+          "touch_icon_exists": false, "favicon_exists": false)";
   struct Case {
     std::vector<std::string> arguments;
     std::string json;
@@ -161,8 +163,8 @@ TEST_F(SitedeckTool, JsonOfListAndShowHasEveryFieldWithNullsForWhatIsNotStored) 
        R"({"items": [)" + news + "}, " + mail + "}, " +
            R"({"id": 5, "url": "https://five.example/",
                "title": "A very long title that will not fit the column",
-               "dominant_color": "#00FF00", "icon_size": null, "touch_icon_exists": 0,
-               "favicon_exists": 1}]})"},
+               "dominant_color": "#00FF00", "icon_size": null, "icon_width": null,
+               "icon_height": null, "touch_icon_exists": false, "favicon_exists": true}]})"},
       {{"show", "7", "--json"}, news + R"(, "icon": {"width": 4, "height": 3, "bytes": 48}})"},
       {{"--json", "show", "3"}, mail + R"(, "icon": null})"},
   };
