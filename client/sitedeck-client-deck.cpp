@@ -16,8 +16,8 @@ int sds_client_read_item(SdsConnection& connection, int32_t id, bool with_icon,
   if (item == nullptr || id < 0) return SDS_ERROR_INVALID_PARAMETER;
   item->id = id;
   struct text_field {
-    int (*read)(SdsConnection&, int32_t, UniqueCStr*);
-    UniqueCStr* value;
+    int (*read)(SdsConnection&, int32_t, SdsClientText*);
+    SdsClientText* value;
     int* status;
   } texts[] = {
       {sds_client_get_url, &item->url, &item->url_status},

@@ -12,42 +12,57 @@
 #include <cstdlib>
 #include <cstring>
 
+#include <unistd.h>
+
 #include "sitedeck-client-commands.h"
 #include "sitedeck-client-internal.h"
-#include "sitedeck-service-log.h"
 #include "sitedeck-service-paths.h"
 
 namespace {
 
-// Makes `view` a mapping of the object now behind the name, holding at least
-// `needed` bytes. SDS_ERROR_NONE or SDS_ERROR_SHM_FAILED.
-int __sds_client_map_shm(SdsShmView& view, size_t needed) {
+// The descriptor of the object, closed when the mapping is made.
+struct ShmFd {
+  int fd;
+  ~ShmFd() {
+    if (fd >= 0) (void)close(fd);
+  }
+};
+
+// Makes the connection's view a mapping of the object now behind the name,
+// holding at least `needed` bytes. SDS_ERROR_NONE or SDS_ERROR_SHM_FAILED.
+int __sds_client_map_shm(SdsConnection& connection, size_t needed) {
+  using Access = SdsConnectionAccess;
   struct stat named {};
-  if (stat(SDS_SHM_FILE_PATH, &named) == 0 && view.data() != nullptr &&
-      named.st_ino == view.inode() && view.size() >= needed &&
+  if (stat(SDS_SHM_FILE_PATH, &named) == 0 && Access::shm_address(connection) != nullptr &&
+      named.st_ino == Access::shm_inode(connection) && Access::shm_size(connection) >= needed &&
       static_cast<size_t>(named.st_size) >= needed) {
     return SDS_ERROR_NONE;
   }
-  view.reset();
-  UniqueFd fd(shm_open(SDS_SHM_NAME, O_RDONLY | O_CLOEXEC, 0));
-  if (!fd) {
-    SDS_LOGE("[CRITICAL] shm_open %s [%s]", SDS_SHM_NAME, strerror(errno));
+  Access::drop_shm(connection);
+  ShmFd fd{shm_open(SDS_SHM_NAME, O_RDONLY | O_CLOEXEC, 0)};
+  if (fd.fd < 0) {
+    Access::set_error(connection, errno);
+    __sds_client_log("shm_open %s: %s", SDS_SHM_NAME, std::strerror(errno));
     return SDS_ERROR_SHM_FAILED;
   }
   struct stat opened {};
-  if (fstat(fd.get(), &opened) != 0) return SDS_ERROR_SHM_FAILED;
+  if (fstat(fd.fd, &opened) != 0) {
+    Access::set_error(connection, errno);
+    return SDS_ERROR_SHM_FAILED;
+  }
   // Touching pages past the object's end would be a SIGBUS, not an error.
   size_t length = std::min(static_cast<size_t>(std::max<off_t>(opened.st_size, 0)), SDS_SHM_SIZE);
   if (length < needed || length == 0) {
-    SDS_LOGE("[CRITICAL] shared memory holds %zu bytes, %zu needed", length, needed);
+    __sds_client_log("shared memory holds %zu bytes, %zu needed", length, needed);
     return SDS_ERROR_SHM_FAILED;
   }
-  void* address = mmap(nullptr, length, PROT_READ, MAP_SHARED, fd.get(), 0);
+  void* address = mmap(nullptr, length, PROT_READ, MAP_SHARED, fd.fd, 0);
   if (address == MAP_FAILED) {
-    SDS_LOGE("[CRITICAL] mmap %s [%s]", SDS_SHM_NAME, strerror(errno));
+    Access::set_error(connection, errno);
+    __sds_client_log("mmap %s: %s", SDS_SHM_NAME, std::strerror(errno));
     return SDS_ERROR_SHM_FAILED;
   }
-  view.adopt(static_cast<const unsigned char*>(address), length, opened.st_ino);
+  Access::adopt_shm(connection, static_cast<const unsigned char*>(address), length, opened.st_ino);
   return SDS_ERROR_NONE;
 }
 
@@ -60,22 +75,23 @@ int sds_client_get_icon(SdsConnection& connection, int32_t item_id, sds_client_i
 
   // Byte count, width, height: width comes first on the wire.
   int32_t reply[3] = {0, 0, 0};
-  int result = __sds_client_read_exact(connection, reply, sizeof reply);
+  int result = __sds_client_read_reply(connection, reply, sizeof reply);
   if (result != SDS_ERROR_NONE) return result;
   const int32_t byte_count = reply[0], width = reply[1], height = reply[2];
   // Only a whole B,G,R,A image that fits the object is read: anything else
   // would read past what the service wrote, or past the object.
   if (byte_count <= 0 || static_cast<size_t>(byte_count) > SDS_SHM_SIZE || width <= 0 ||
       height <= 0 || int64_t{width} * height * 4 != byte_count) {
-    SDS_LOGE("[ERROR] icon reply: %d bytes for %dx%d", byte_count, width, height);
+    __sds_client_log("icon reply: %d bytes for %dx%d", byte_count, width, height);
     return SDS_ERROR_INVALID_PARAMETER;
   }
-  result = __sds_client_map_shm(connection.shm_view(), static_cast<size_t>(byte_count));
+  result = __sds_client_map_shm(connection, static_cast<size_t>(byte_count));
   if (result != SDS_ERROR_NONE) return result;
-  UniqueMalloc<unsigned char> pixels(
+  SdsClientBuffer<unsigned char> pixels(
       static_cast<unsigned char*>(std::malloc(static_cast<size_t>(byte_count))));
   if (!pixels) return SDS_ERROR_OUT_OF_MEMORY;
-  std::memcpy(pixels.get(), connection.shm_view().data(), static_cast<size_t>(byte_count));
+  std::memcpy(pixels.get(), SdsConnectionAccess::shm_address(connection),
+              static_cast<size_t>(byte_count));
   icon->pixels = std::move(pixels);
   icon->byte_count = byte_count;
   icon->width = width;

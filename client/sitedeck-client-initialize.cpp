@@ -1,9 +1,7 @@
 // Command 1 from the client's side: position, then the optional browser
 // version, then the long wait for the data pull's result. The wait polls the
-// socket in ticks so that a caller can show progress or give up; nothing
-// bounds it otherwise, since a pull with retries can take minutes.
-#include <poll.h>
-
+// socket in ticks so that a caller can show progress or give up; the pull
+// time-out bounds it, long enough for a pull with retries.
 #include <cerrno>
 #include <cstring>
 
@@ -18,14 +16,16 @@ constexpr int32_t kNoVersion = SDS_ERROR_NO_DATA;
 constexpr int kDefaultTickMs = 100;
 
 // Waits until the final status can be read. SDS_ERROR_NONE, or
-// SDS_ERROR_IO_EINTR when `waiting` gave up.
-int __sds_client_wait_for_result(int fd, sds_client_wait_fn waiting, void* user, int tick_ms) {
+// SDS_ERROR_IO_EINTR when `waiting` gave up or the pull time-out passed.
+int __sds_client_wait_for_result(int fd, sds_client_wait_fn waiting, void* user, int tick_ms,
+                                 int64_t deadline) {
   for (;;) {
-    struct pollfd entry = {fd, POLLIN, 0};
-    int ready = poll(&entry, 1, waiting != nullptr ? tick_ms : -1);
-    if (ready > 0) return SDS_ERROR_NONE;                    // the status, or the end of the stream
-    if (ready < 0 && errno != EINTR) return SDS_ERROR_NONE;  // the read reports it
-    if (ready == 0 && !waiting(user)) return SDS_ERROR_IO_EINTR;
+    int64_t tick_deadline = waiting != nullptr ? __sds_client_deadline(tick_ms) : deadline;
+    if (deadline >= 0 && tick_deadline > deadline) tick_deadline = deadline;
+    int ready = __sds_client_wait_readable(fd, tick_deadline);
+    if (ready != 0) return SDS_ERROR_NONE;  // the status, the end, or a failure the read reports
+    if (deadline >= 0 && tick_deadline == deadline) return SDS_ERROR_IO_EINTR;
+    if (!waiting(user)) return SDS_ERROR_IO_EINTR;
   }
 }
 
@@ -64,7 +64,10 @@ int sds_client_initialize(SdsConnection& connection, double latitude, double lon
   result = __sds_client_send(connection, message, message_length);
   if (result != SDS_ERROR_NONE) return result;
 
-  if (__sds_client_wait_for_result(connection.fd(), waiting, user, tick_ms) != SDS_ERROR_NONE) {
+  const int64_t deadline = __sds_client_deadline(connection.timeouts().pull_ms);
+  if (__sds_client_wait_for_result(connection.fd(), waiting, user, tick_ms, deadline) !=
+      SDS_ERROR_NONE) {
+    __sds_client_log("gave up waiting for the pull's result");
     connection.close();
     return SDS_ERROR_IO_EINTR;
   }

@@ -2,13 +2,12 @@
 // one item (3 to 6, 8, 9), the next update duration (10), the id lists (11)
 // and the removal of the shared-memory object (2). Replies are laid out in
 // docs/protocol.md.
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 
 #include "sitedeck-client-commands.h"
 #include "sitedeck-client-internal.h"
-#include "sitedeck-service-ipc.h"
-#include "sitedeck-service-log.h"
 
 namespace {
 
@@ -18,19 +17,13 @@ constexpr int32_t kNoCondition = SDS_ERROR_NO_DATA;
 constexpr int32_t kConditionFollows = 0;
 
 int __sds_client_get_text(SdsConnection& connection, int32_t cmd, int32_t item_id,
-                          UniqueCStr* out) {
+                          SdsClientText* out) {
   if (out == nullptr || item_id < 0) return SDS_ERROR_INVALID_PARAMETER;
   int status = sds_client_request(connection, cmd, item_id);
   if (status != SDS_ERROR_NONE) return __sds_client_status_ends(connection, status);
   // A stored text the protocol can't carry (over 4096 bytes) ends the reply
   // after the status; the read then times out, and the connection goes.
-  char* text = sds_ipc_read_string(connection.fd());
-  if (text == nullptr) {
-    connection.close();
-    return SDS_ERROR_IO_ERROR;
-  }
-  out->reset(text);
-  return SDS_ERROR_NONE;
+  return __sds_client_read_string(connection, out);
 }
 
 int __sds_client_get_word(SdsConnection& connection, int32_t cmd, int32_t item_id, int32_t* out) {
@@ -38,7 +31,7 @@ int __sds_client_get_word(SdsConnection& connection, int32_t cmd, int32_t item_i
   int status = sds_client_request(connection, cmd, item_id);
   if (status != SDS_ERROR_NONE) return __sds_client_status_ends(connection, status);
   int32_t value = 0;
-  int result = __sds_client_read_exact(connection, &value, sizeof value);
+  int result = __sds_client_read_reply(connection, &value, sizeof value);
   if (result != SDS_ERROR_NONE) return result;
   *out = value;
   return SDS_ERROR_NONE;
@@ -63,21 +56,22 @@ int __sds_client_get_ids(SdsConnection& connection, const unsigned char* conditi
   if (status != SDS_ERROR_NONE) return __sds_client_status_ends(connection, status);
 
   int32_t count = 0;
-  result = __sds_client_read_exact(connection, &count, sizeof count);
+  result = __sds_client_read_reply(connection, &count, sizeof count);
   if (result != SDS_ERROR_NONE) return result;
   if (count < 0 || count > SDS_CLIENT_MAX_IDS) {
-    SDS_LOGE("[ERROR] id count:%d out of range", count);
+    __sds_client_log("id count %d out of range", count);
+    SdsConnectionAccess::set_error(connection, EPROTO);
     connection.close();
     return SDS_ERROR_INVALID_PARAMETER;
   }
-  UniqueMalloc<int32_t> ids;
+  SdsClientBuffer<int32_t> ids;
   if (count > 0) {
     ids.reset(static_cast<int32_t*>(std::malloc(static_cast<size_t>(count) * sizeof(int32_t))));
     if (!ids) {
       connection.close();
       return SDS_ERROR_OUT_OF_MEMORY;
     }
-    result = __sds_client_read_exact(connection, ids.get(),
+    result = __sds_client_read_reply(connection, ids.get(),
                                      static_cast<size_t>(count) * sizeof(int32_t));
     if (result != SDS_ERROR_NONE) return result;
   }
@@ -88,27 +82,6 @@ int __sds_client_get_ids(SdsConnection& connection, const unsigned char* conditi
 
 }  // namespace
 
-int __sds_client_status_ends(SdsConnection& connection, int status) {
-  if (status == SDS_ERROR_IO_ERROR || status == SDS_ERROR_OUT_OF_MEMORY) connection.close();
-  return status;
-}
-
-int __sds_client_read_exact(SdsConnection& connection, void* buffer, size_t length) {
-  if (connection.is_open() && sds_ipc_read_blob(connection.fd(), buffer, length) == 0) {
-    return SDS_ERROR_NONE;
-  }
-  connection.close();
-  return SDS_ERROR_IO_ERROR;
-}
-
-int __sds_client_send(SdsConnection& connection, const void* buffer, size_t length) {
-  if (connection.is_open() && sds_ipc_send_custom_type(connection.fd(), buffer, length) == 0) {
-    return SDS_ERROR_NONE;
-  }
-  connection.close();
-  return SDS_ERROR_IO_ERROR;
-}
-
 int sds_client_release_shm(SdsConnection& connection) {
   int status = sds_client_request(connection, SDS_CMD_FREE_SHM, 0);
   // Status 0 is the service's last word on this connection.
@@ -116,19 +89,19 @@ int sds_client_release_shm(SdsConnection& connection) {
   return __sds_client_status_ends(connection, status);
 }
 
-int sds_client_get_url(SdsConnection& connection, int32_t item_id, UniqueCStr* url) {
+int sds_client_get_url(SdsConnection& connection, int32_t item_id, SdsClientText* url) {
   return __sds_client_get_text(connection, SDS_CMD_GET_URL, item_id, url);
 }
 
-int sds_client_get_title(SdsConnection& connection, int32_t item_id, UniqueCStr* title) {
+int sds_client_get_title(SdsConnection& connection, int32_t item_id, SdsClientText* title) {
   return __sds_client_get_text(connection, SDS_CMD_GET_TITLE, item_id, title);
 }
 
-int sds_client_get_icon_size(SdsConnection& connection, int32_t item_id, UniqueCStr* size) {
+int sds_client_get_icon_size(SdsConnection& connection, int32_t item_id, SdsClientText* size) {
   return __sds_client_get_text(connection, SDS_CMD_GET_ICON_SIZE, item_id, size);
 }
 
-int sds_client_get_dominant_color(SdsConnection& connection, int32_t item_id, UniqueCStr* color) {
+int sds_client_get_dominant_color(SdsConnection& connection, int32_t item_id, SdsClientText* color) {
   return __sds_client_get_text(connection, SDS_CMD_GET_DOMINANT_COLOR, item_id, color);
 }
 

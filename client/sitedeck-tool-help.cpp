@@ -18,7 +18,8 @@ struct sds_tool_help {
 
 constexpr char kServiceExits[] =
     "  0  success\n"
-    "  1  the service answered a non-zero status, or could not be reached\n"
+    "  1  the service answered a non-zero status, could not be reached, or the\n"
+    "     output could not be written\n"
     "  2  bad usage\n";
 
 constexpr sds_tool_help kHelp[] = {
@@ -56,27 +57,30 @@ constexpr sds_tool_help kHelp[] = {
      "", "sitedeck release",
      "  0  the object was removed\n"
      "  1  the service answered a non-zero status (2: the object was already\n"
-     "     gone), or could not be reached\n"
+     "     gone), could not be reached, or the output could not be written\n"
      "  2  bad usage\n"},
     {"init",
      "Hands the service a position and a browser version and runs a data pull\n"
      "from the content servers, waiting for its result (this can take minutes;\n"
      "on a terminal a spinner shows it runs). The result is printed by number,\n"
      "name and meaning.\n",
-     "  --lat LAT    latitude in degrees\n"
-     "  --lon LON    longitude in degrees\n"
+     "  --lat LAT    latitude in degrees, -90 to 90\n"
+     "  --lon LON    longitude in degrees, -180 to 180\n"
      "  --version V  the browser version sent to the content server\n",
      "sitedeck init --lat 37.5665 --lon 126.978 --version 2.0",
      "  0  a new item list was stored (status 0), or the server found the stored\n"
      "     one current (status 17, not modified): either way the deck is current\n"
      "  1  the pull failed (the status says why) or the service was unreachable\n"
-     "  2  bad usage\n"},
+     "  2  bad usage, or a position outside -90..90 / -180..180 degrees\n"},
     {"render",
      "Writes the start page the browser would show: the live items in the\n"
      "server's order as tiles with their icon, title and dominant colour, in\n"
      "one self-contained HTML file, OUT_DIR/index.html (OUT_DIR is created when\n"
      "missing; the page is written whole or not at all). Sites the server\n"
      "withdrew are left out; an item without an icon gets its first letter.\n"
+     "The header says where the deck came from (the installed default deck, or\n"
+     "a pull for which region and when) and how many withdrawn sites it leaves\n"
+     "out; each tile shows its site's host under its title.\n"
      "Prints the page's path.\n",
      "  OUT_DIR  the directory for index.html\n",
      "sitedeck render /tmp/deck && chromium /tmp/deck/index.html",
@@ -88,12 +92,14 @@ constexpr sds_tool_help kHelp[] = {
      "Shows what the service has stored, from the files under its data\n"
      "directory only, so it works while the service is stopped, and changes\n"
      "nothing: the configured servers, the stored ETag, the next update\n"
-     "duration, the last resolved position with its city and province, the\n"
-     "number of live and hidden items and the age of the database. A missing\n"
-     "file is shown as \"none\".\n",
+     "duration, when the last pull ended and how, when the next is due, the\n"
+     "last resolved position with its city and province, the number of live\n"
+     "and withdrawn items and the age of the database. A missing file is shown\n"
+     "as \"none\", one this user may not read as \"permission denied\".\n",
      "", "sitedeck status\n  SITEDECK_ROOT=/tmp/scratch sitedeck --json status",
      "  0  the data directory exists (whatever is missing inside it)\n"
-     "  1  there is no data directory\n"
+     "  1  there is no data directory, a file in it may not be read by this\n"
+     "     user, or the output could not be written\n"
      "  2  bad usage\n"},
 };
 

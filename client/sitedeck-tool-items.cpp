@@ -11,8 +11,8 @@
 #include <vector>
 
 #include "sitedeck-client-deck.h"
-#include "sitedeck-client-status-text.h"
-#include "sitedeck-service-ipc.h"
+#include "sitedeck-client-status.h"
+#include "sitedeck-service-raii.h"
 #include "sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
@@ -21,7 +21,7 @@ namespace {
 
 constexpr char kMissing[] = "-";
 
-std::string __text_or_missing(const UniqueCStr& value) { return value ? value.get() : kMissing; }
+std::string __text_or_missing(const SdsClientText& value) { return value ? value.get() : kMissing; }
 
 std::string __flags(const sds_client_item& item) {
   std::string flags;
@@ -30,12 +30,28 @@ std::string __flags(const sds_client_item& item) {
   return flags.empty() ? kMissing : flags;
 }
 
-// A flag member: its value when the service had one, else null.
+// A flag member: true or false when the service had one, else null.
 void __json_flag(JsonBuilder* builder, const char* name, int status, int32_t value) {
   if (status == SDS_ERROR_NONE) {
-    sds_tool_json_int(builder, name, value);
+    sds_tool_json_bool(builder, name, value != 0);
   } else {
     sds_tool_json_null(builder, name);
+  }
+}
+
+// The icon size as the service stores it ("WIDTHxHEIGHT") and, when it is
+// one, its two numbers beside it; null members otherwise.
+void __json_icon_size(JsonBuilder* builder, const SdsClientText& size) {
+  sds_tool_json_text(builder, "icon_size", size.get());
+  int width = 0, height = 0;
+  char tail = '\0';
+  if (size && std::sscanf(size.get(), "%dx%d%c", &width, &height, &tail) == 2 && width > 0 &&
+      height > 0) {
+    sds_tool_json_int(builder, "icon_width", width);
+    sds_tool_json_int(builder, "icon_height", height);
+  } else {
+    sds_tool_json_null(builder, "icon_width");
+    sds_tool_json_null(builder, "icon_height");
   }
 }
 
@@ -45,7 +61,7 @@ void __json_item_fields(JsonBuilder* builder, const sds_client_item& item) {
   sds_tool_json_text(builder, "url", item.url.get());
   sds_tool_json_text(builder, "title", item.title.get());
   sds_tool_json_text(builder, "dominant_color", item.dominant_color.get());
-  sds_tool_json_text(builder, "icon_size", item.icon_size.get());
+  __json_icon_size(builder, item.icon_size);
   __json_flag(builder, "touch_icon_exists", item.touch_icon_status, item.touch_icon_exists);
   __json_flag(builder, "favicon_exists", item.favicon_status, item.favicon_exists);
 }
@@ -88,9 +104,18 @@ int sds_tool_list(SdsConnection& connection, int argc, char** /*argv*/) {
   return SDS_ERROR_NONE;
 }
 
-bool sds_tool_show_arguments(int argc, char** argv) {
+bool sds_tool_show_arguments(int argc, char** argv, std::string* problem) {
   int32_t id = 0;
-  return argc == 1 && sds_tool_parse_id(argv[0], &id);
+  if (argc == 0) {
+    *problem = "ID is missing";
+  } else if (argc > 1) {
+    *problem = std::string("unexpected argument ") + argv[1];
+  } else if (!sds_tool_parse_id(argv[0], &id)) {
+    *problem = std::string(argv[0]) + " is not an item id (a whole number from 0)";
+  } else {
+    return true;
+  }
+  return false;
 }
 
 int sds_tool_show(SdsConnection& connection, int argc, char** argv) {
@@ -132,7 +157,7 @@ int sds_tool_show(SdsConnection& connection, int argc, char** argv) {
   auto flag = [](int field_status, int32_t value) {
     return field_status == SDS_ERROR_NONE ? std::to_string(value) : std::string("(none)");
   };
-  auto text = [](const UniqueCStr& value) { return value ? value.get() : "(none)"; };
+  auto text = [](const SdsClientText& value) { return value ? value.get() : "(none)"; };
   std::string pixels = "(none)";
   if (icon_status == SDS_ERROR_NONE) {
     pixels = std::to_string(icon.width) + "x" + std::to_string(icon.height) + ", " +
@@ -158,31 +183,47 @@ int sds_tool_show(SdsConnection& connection, int argc, char** argv) {
 }
 
 // `icon ID -o FILE`, the two in either order.
-static bool __icon_arguments(int argc, char** argv, int32_t* id, const char** output) {
+static bool __icon_arguments(int argc, char** argv, int32_t* id, const char** output,
+                             std::string* problem) {
   const char* id_text = nullptr;
   *output = nullptr;
   for (int i = 0; i < argc; ++i) {
-    if (std::strcmp(argv[i], "-o") == 0 && i + 1 < argc && *output == nullptr) {
+    if (std::strcmp(argv[i], "-o") == 0 && *output == nullptr) {
+      if (i + 1 >= argc || argv[i + 1][0] == '\0') {
+        *problem = "-o needs a FILE";
+        return false;
+      }
       *output = argv[++i];
     } else if (id_text == nullptr) {
       id_text = argv[i];
     } else {
+      *problem = std::string("unexpected argument ") + argv[i];
       return false;
     }
   }
-  return id_text != nullptr && *output != nullptr && sds_tool_parse_id(id_text, id);
+  if (id_text == nullptr) {
+    *problem = "ID is missing";
+  } else if (!sds_tool_parse_id(id_text, id)) {
+    *problem = std::string(id_text) + " is not an item id (a whole number from 0)";
+  } else if (*output == nullptr) {
+    *problem = "-o FILE is missing";
+  } else {
+    return true;
+  }
+  return false;
 }
 
-bool sds_tool_icon_arguments(int argc, char** argv) {
+bool sds_tool_icon_arguments(int argc, char** argv, std::string* problem) {
   int32_t id = 0;
   const char* output = nullptr;
-  return __icon_arguments(argc, argv, &id, &output);
+  return __icon_arguments(argc, argv, &id, &output, problem);
 }
 
 int sds_tool_icon(SdsConnection& connection, int argc, char** argv) {
   int32_t id = 0;
   const char* output = nullptr;
-  if (!__icon_arguments(argc, argv, &id, &output)) return kSdsToolUsage;
+  std::string problem;
+  if (!__icon_arguments(argc, argv, &id, &output, &problem)) return kSdsToolUsage;
   sds_client_icon icon;
   int status = sds_client_get_icon(connection, id, &icon);
   if (status != SDS_ERROR_NONE) return status;

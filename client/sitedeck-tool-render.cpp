@@ -2,7 +2,7 @@
 // it, written to OUT_DIR/index.html for a person to open. It reads the deck
 // the way the browser does (the live ids in the server's order, then each
 // item's fields and pixels) and leaves the page itself to
-// sitedeck-client-page.h.
+// sitedeck-tool-page.h.
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
@@ -11,7 +11,10 @@
 #include <json-glib/json-glib.h>
 
 #include "sitedeck-client-deck.h"
-#include "sitedeck-client-page.h"
+#include "sitedeck-service-paths.h"
+#include "sitedeck-service-raii.h"
+#include "sitedeck-tool-last-pull.h"
+#include "sitedeck-tool-page.h"
 #include "sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
@@ -71,18 +74,48 @@ int __sds_render_icon(SdsConnection& connection, sds_render_item* entry, size_t*
   return SDS_ERROR_NONE;
 }
 
+// Where the deck came from, from the pull's record beside the database.
+std::string __sds_render_origin() {
+  sds_last_pull pull = sds_tool_read_last_pull(sds_path(SDS_LAST_PULL_PATH));
+  if (pull.state == sds_last_pull_state::denied || pull.state == sds_last_pull_state::unreadable) {
+    return "where the deck came from is not known (the pull's record cannot be read)";
+  }
+  if (pull.state == sds_last_pull_state::missing || pull.stored == 0) {
+    return "from the installed default deck (no pull has stored a list yet)";
+  }
+  std::string region = pull.city;
+  if (!pull.province.empty()) region += (region.empty() ? "" : ", ") + pull.province;
+  struct tm when {};
+  char stamp[32] = "";
+  if (gmtime_r(&pull.stored, &when) != nullptr) {
+    (void)std::strftime(stamp, sizeof stamp, "%Y-%m-%d %H:%M UTC", &when);
+  }
+  return std::string("from a pull") + (region.empty() ? "" : " for " + region) + ", stored " +
+         stamp;
+}
+
 }  // namespace
 
-bool sds_tool_render_arguments(int argc, char** argv) {
-  return argc == 1 && argv[0][0] != '\0' && argv[0][0] != '-';
+bool sds_tool_render_arguments(int argc, char** argv, std::string* problem) {
+  if (argc == 0) {
+    *problem = "OUT_DIR is missing";
+  } else if (argc > 1) {
+    *problem = std::string("unexpected argument ") + argv[1];
+  } else if (argv[0][0] == '\0' || argv[0][0] == '-') {
+    *problem = std::string("\"") + argv[0] + "\" is not a directory name";
+  } else {
+    return true;
+  }
+  return false;
 }
 
 int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
-  if (!sds_tool_render_arguments(argc, argv)) return kSdsToolUsage;
+  std::string problem;
+  if (!sds_tool_render_arguments(argc, argv, &problem)) return kSdsToolUsage;
   const char* out_dir = argv[0];
 
-  // Specially removed sites are not live, so the browser's list, and this
-  // page, leave them out.
+  // Withdrawn sites are not live, so the browser's list, and this page,
+  // leave them out.
   sds_client_ids ids;
   int status = sds_client_get_ids_by_dirty(connection, 1, &ids);
   if (status != SDS_ERROR_NONE && status != SDS_ERROR_NO_DATA) return status;
@@ -94,6 +127,16 @@ int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
     count = kMaxTiles;
   }
   size_t icon_bytes = 0;
+  // Withdrawn sites stay in the store but not on the page: say how many.
+  sds_client_ids withdrawn;
+  int withdrawn_status = sds_client_get_ids_by_dirty(connection, -1, &withdrawn);
+  if (withdrawn_status != SDS_ERROR_NONE && withdrawn_status != SDS_ERROR_NO_DATA) {
+    return withdrawn_status;
+  }
+  const std::string origin = __sds_render_origin();
+  sds_page_source source;
+  source.origin = origin.c_str();
+  source.withdrawn = withdrawn_status == SDS_ERROR_NONE ? static_cast<size_t>(withdrawn.count) : 0;
 
   std::vector<sds_render_item> entries(count);
   std::vector<sds_page_tile> tiles(count);
@@ -112,7 +155,7 @@ int sds_tool_render(SdsConnection& connection, int argc, char** argv) {
   }
 
   char* html_text = nullptr;
-  status = sds_page_render(tiles.data(), count, std::time(nullptr), &html_text);
+  status = sds_page_render(tiles.data(), count, source, std::time(nullptr), &html_text);
   if (status != SDS_ERROR_NONE) return status;
   UniqueCStr html(html_text);
   char* path_text = nullptr;

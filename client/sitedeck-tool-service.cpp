@@ -13,8 +13,8 @@
 #include <cstring>
 
 #include "sitedeck-client-commands.h"
-#include "sitedeck-client-status-text.h"
-#include "sitedeck-service-ipc.h"
+#include "sitedeck-client-status.h"
+#include "sitedeck-service-raii.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 
@@ -139,40 +139,68 @@ int sds_tool_release(SdsConnection& connection, int argc, char** /*argv*/) {
   return SDS_ERROR_NONE;
 }
 
-bool sds_tool_no_arguments(int argc, char** /*argv*/) { return argc == 0; }
-
-// `init --lat LAT --lon LON [--version V]`, in any order.
-static bool __init_arguments(int argc, char** argv, double* latitude, double* longitude,
-                      const char** version) {
-  bool have_latitude = false, have_longitude = false;
-  *version = nullptr;
-  // Options come in pairs: name, value.
-  if (argc % 2 != 0) return false;
-  for (int i = 0; i < argc; i += 2) {
-    const char* value = argv[i + 1];
-    if (std::strcmp(argv[i], "--lat") == 0 && sds_tool_parse_double(value, latitude)) {
-      have_latitude = true;
-    } else if (std::strcmp(argv[i], "--lon") == 0 && sds_tool_parse_double(value, longitude)) {
-      have_longitude = true;
-    } else if (std::strcmp(argv[i], "--version") == 0) {
-      *version = value;
-    } else {
-      return false;
-    }
-  }
-  return have_latitude && have_longitude;
+bool sds_tool_no_arguments(int argc, char** argv, std::string* problem) {
+  if (argc == 0) return true;
+  *problem = std::string("unexpected argument ") + argv[0];
+  return false;
 }
 
-bool sds_tool_init_arguments(int argc, char** argv) {
+// `init --lat LAT --lon LON [--version V]`, in any order. A position the
+// service would not use (it would pull without one) is refused here, so a
+// typing mistake is not mistaken for a pull for nowhere.
+static bool __init_arguments(int argc, char** argv, double* latitude, double* longitude,
+                             const char** version, std::string* problem) {
+  bool have_latitude = false, have_longitude = false;
+  *version = nullptr;
+  for (int i = 0; i < argc; i += 2) {
+    const bool is_lat = std::strcmp(argv[i], "--lat") == 0;
+    const bool is_lon = std::strcmp(argv[i], "--lon") == 0;
+    if (!is_lat && !is_lon && std::strcmp(argv[i], "--version") != 0) {
+      *problem = std::string("unexpected argument ") + argv[i];
+      return false;
+    }
+    if (i + 1 >= argc) {
+      *problem = std::string(argv[i]) + (is_lat || is_lon ? " needs degrees" : " needs a value");
+      return false;
+    }
+    const char* value = argv[i + 1];
+    if (!is_lat && !is_lon) {
+      *version = value;
+      continue;
+    }
+    double* degrees = is_lat ? latitude : longitude;
+    const double limit = is_lat ? 90 : 180;
+    if (!sds_tool_parse_double(value, degrees)) {
+      *problem = std::string(argv[i]) + " needs degrees (a number), not " + value;
+      return false;
+    }
+    if (*degrees < -limit || *degrees > limit) {
+      *problem = std::string(is_lat ? "latitude " : "longitude ") + value + " is outside " +
+                 (is_lat ? "-90..90" : "-180..180");
+      return false;
+    }
+    (is_lat ? have_latitude : have_longitude) = true;
+  }
+  if (!have_latitude || !have_longitude) {
+    *problem = !have_latitude ? "--lat LAT is missing" : "--lon LON is missing";
+    return false;
+  }
+  return true;
+}
+
+bool sds_tool_init_arguments(int argc, char** argv, std::string* problem) {
   double latitude = 0, longitude = 0;
   const char* version = nullptr;
-  return __init_arguments(argc, argv, &latitude, &longitude, &version);
+  return __init_arguments(argc, argv, &latitude, &longitude, &version, problem);
 }
 
 int sds_tool_init(SdsConnection& connection, int argc, char** argv) {
   double latitude = 0, longitude = 0;
   const char* version = nullptr;
-  if (!__init_arguments(argc, argv, &latitude, &longitude, &version)) return kSdsToolUsage;
+  std::string problem;
+  if (!__init_arguments(argc, argv, &latitude, &longitude, &version, &problem)) {
+    return kSdsToolUsage;
+  }
 
   sds_tool_spinner spinner;
   bool animate = isatty(STDERR_FILENO) == 1;

@@ -1,5 +1,8 @@
 // `sitedeck status`: what the service has stored, read from the files under
-// its data directory alone, so that it works while the service is stopped.
+// its data directory alone, so that it works while the service is stopped:
+// the servers, the ETag, when the last pull ran and how it ended, when the
+// next is due, the position, the items. A file the user may not read is
+// told as such (and fails the command), never taken for a missing one.
 // It must never change anything there: the server list and the location are
 // read with the service's own readers, the database is opened read-only (a
 // missing one is reported, never created), and no file is written.
@@ -7,8 +10,11 @@
 
 #include <json-glib/json-glib.h>
 #include <sqlite3.h>
+#include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
@@ -22,6 +28,8 @@
 #include "sitedeck-service-request-server.h"
 #include "sitedeck-service-server-data.h"
 #include "sitedeck-service-xml-read.h"
+#include "sitedeck-client-status.h"
+#include "sitedeck-tool-last-pull.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 
@@ -59,14 +67,31 @@ struct sds_status_report {
   std::string position, city, province;
   bool have_database = false;
   std::string database_path, database_problem;
-  long long live_items = 0, hidden_items = 0;
+  long long live_items = 0, withdrawn_items = 0;
   time_t modified = 0;
+  sds_last_pull last_pull;
+  // Files that exist but that this user may not read.
+  std::vector<std::string> denied;
 };
+
+// True (and noted in the report) when `path` cannot be read for lack of
+// permission, on the file or on a directory above it.
+bool __denied(sds_status_report* report, const std::string& path) {
+  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd >= 0) {
+    (void)close(fd);
+    return false;
+  }
+  if (errno != EACCES && errno != EPERM) return false;
+  report->denied.push_back(path);
+  return true;
+}
 
 // The text of a small file with trailing blanks and line ends dropped; false
 // when it is missing, unreadable or empty.
-bool __read_small_text(const char* fixed_path, std::string* text) {
+bool __read_small_text(sds_status_report* report, const char* fixed_path, std::string* text) {
   const std::string path = sds_path(fixed_path);
+  if (__denied(report, path)) return false;
   size_t length = 0;
   UniqueMalloc<char> content(sds_read_file_bounded(path.c_str(), kSmallFileCap, &length));
   if (!content) return false;
@@ -79,6 +104,7 @@ bool __read_small_text(const char* fixed_path, std::string* text) {
 
 void __gather_servers(sds_status_report* report) {
   const std::string path = sds_path(SDS_SERVER_DATA_XML);
+  if (__denied(report, path)) return;
   sds_server_list* list = sds_get_server_data(path.c_str());
   report->have_server_list = list != nullptr;
   for (const sds_server_list* node = list; node != nullptr; node = node->next) {
@@ -91,7 +117,8 @@ void __gather_servers(sds_status_report* report) {
 }
 
 void __gather_duration(sds_status_report* report) {
-  report->have_duration = __read_small_text(SDS_NEXT_UPDATE_DURATION_PATH, &report->duration_text);
+  report->have_duration =
+      __read_small_text(report, SDS_NEXT_UPDATE_DURATION_PATH, &report->duration_text);
   // The service reads the number the same way and falls back below 1.
   if (report->have_duration && std::atoi(report->duration_text.c_str()) > 0) {
     report->duration_seconds = std::atoi(report->duration_text.c_str());
@@ -106,6 +133,7 @@ std::string __element_text(xmlNode* element) {
 
 void __gather_location(sds_status_report* report) {
   const std::string path = sds_path(SDS_LOCATION_INFO_PATH);
+  if (__denied(report, path)) return;
   UniqueXmlDoc doc = sds_xml_read_file(path.c_str());
   xmlNode* root = doc ? xmlDocGetRootElement(doc.get()) : nullptr;
   if (root == nullptr || !sds_xml_is_element(root, "Location")) return;
@@ -135,13 +163,14 @@ void __gather_database(sds_status_report* report) {
   report->database_path = sds_path(SDS_DB_PATH);
   struct stat info {};
   if (stat(report->database_path.c_str(), &info) != 0 || !S_ISREG(info.st_mode)) return;
+  if (__denied(report, report->database_path)) return;
   sqlite3* raw = nullptr;
   int rc = sqlite3_open_v2(report->database_path.c_str(), &raw, SQLITE_OPEN_READONLY, nullptr);
   UniqueSqlite db(raw);
   // A service writing at this moment holds the lock briefly; wait that long.
   if (rc == SQLITE_OK) (void)sqlite3_busy_timeout(raw, kBusyWaitMs);
   if (rc != SQLITE_OK || !__count_items(raw, 1, &report->live_items) ||
-      !__count_items(raw, -1, &report->hidden_items)) {
+      !__count_items(raw, -1, &report->withdrawn_items)) {
     report->database_problem = raw != nullptr ? sqlite3_errmsg(raw) : sqlite3_errstr(rc);
     return;
   }
@@ -175,16 +204,25 @@ std::string __server_table(const sds_status_report& report, const sds_tool_setti
 void __print_text(const sds_status_report& report, const sds_tool_settings& settings) {
   // Keys of both blocks line up: "data directory" is the widest.
   constexpr size_t kKeyColumns = sizeof "data directory:" - 1;
+  // What the reader of a file the user may not read sees instead of "none".
+  auto none = [&report](const char* fixed) {
+    const std::string path = sds_path(fixed);
+    for (const auto& denied : report.denied) {
+      if (denied == path) return std::string("permission denied");
+    }
+    return std::string("none");
+  };
   std::string servers =
       report.have_server_list
           ? std::to_string(report.servers.size()) + " configured"
-          : "none (no usable server list at " + sds_path(SDS_SERVER_DATA_XML) + ")";
+          : none(SDS_SERVER_DATA_XML) + " (no usable server list at " +
+                sds_path(SDS_SERVER_DATA_XML) + ")";
   std::string out = sds_tool_format_fields(
       {{"data directory", {report.data_dir}}, {"servers", {servers}}}, settings, kKeyColumns);
   if (!report.servers.empty()) out += __server_table(report, settings);
 
   std::vector<std::pair<std::string, sds_tool_cell>> fields;
-  fields.push_back({"stored ETag", {report.have_etag ? report.etag : "none"}});
+  fields.push_back({"stored ETag", {report.have_etag ? report.etag : none(SDS_ETAG_PATH)}});
   std::string duration = "none (86400 s is used)";
   if (report.duration_valid) {
     duration = std::to_string(report.duration_seconds) + " s";
@@ -192,7 +230,24 @@ void __print_text(const sds_status_report& report, const sds_tool_settings& sett
     duration = "\"" + report.duration_text + "\" is not above 0 (86400 s is used)";
   }
   fields.push_back({"next update", {duration}});
-  std::string location = "none";
+  const sds_last_pull& pull = report.last_pull;
+  switch (pull.state) {
+    case sds_last_pull_state::present:
+      fields.push_back({"last pull", {__time_stamp(pull.time) + ", " +
+                                      sds_client_status_name(pull.status)}});
+      fields.push_back({"next due", {__time_stamp(pull.time + report.duration_seconds)}});
+      break;
+    case sds_last_pull_state::missing:
+      fields.push_back({"last pull", {"none (no pull has run)"}});
+      break;
+    case sds_last_pull_state::denied:
+      fields.push_back({"last pull", {"permission denied"}});
+      break;
+    case sds_last_pull_state::unreadable:
+      fields.push_back({"last pull", {"unreadable (" + sds_path(SDS_LAST_PULL_PATH) + ")"}});
+      break;
+  }
+  std::string location = none(SDS_LOCATION_INFO_PATH);
   if (report.have_location) {
     location = report.position + " (" + (report.city.empty() ? "?" : report.city) + ", " +
                (report.province.empty() ? "?" : report.province) + ")";
@@ -201,7 +256,7 @@ void __print_text(const sds_status_report& report, const sds_tool_settings& sett
   if (report.have_database) {
     fields.push_back({"items",
                       {std::to_string(report.live_items) + " live, " +
-                       std::to_string(report.hidden_items) + " hidden"}});
+                       std::to_string(report.withdrawn_items) + " withdrawn"}});
     fields.push_back({"database",
                       {"modified " + sds_tool_format_age(std::time(nullptr) - report.modified) +
                        " (" + __time_stamp(report.modified) + ")"}});
@@ -241,6 +296,23 @@ bool __print_json(const sds_status_report& report) {
   sds_tool_json_text(b, "stored", report.have_duration ? report.duration_text.c_str() : nullptr);
   sds_tool_json_int(b, "seconds", report.duration_seconds);
   json_builder_end_object(b);
+  const sds_last_pull& pull = report.last_pull;
+  if (pull.state == sds_last_pull_state::present) {
+    json_builder_set_member_name(b, "last_pull");
+    json_builder_begin_object(b);
+    sds_tool_json_int(b, "time", static_cast<long long>(pull.time));
+    sds_tool_json_int(b, "status", pull.status);
+    sds_tool_json_text(b, "name", sds_client_status_name(pull.status));
+    json_builder_end_object(b);
+    sds_tool_json_int(b, "next_due", static_cast<long long>(pull.time + report.duration_seconds));
+  } else {
+    sds_tool_json_null(b, "last_pull");
+    sds_tool_json_null(b, "next_due");
+  }
+  json_builder_set_member_name(b, "permission_denied");
+  json_builder_begin_array(b);
+  for (const auto& path : report.denied) json_builder_add_string_value(b, path.c_str());
+  json_builder_end_array(b);
   if (report.have_location) {
     json_builder_set_member_name(b, "location");
     json_builder_begin_object(b);
@@ -256,7 +328,7 @@ bool __print_json(const sds_status_report& report) {
     json_builder_begin_object(b);
     sds_tool_json_text(b, "path", report.database_path.c_str());
     sds_tool_json_int(b, "live_items", report.live_items);
-    sds_tool_json_int(b, "hidden_items", report.hidden_items);
+    sds_tool_json_int(b, "withdrawn_items", report.withdrawn_items);
     sds_tool_json_int(b, "modified", static_cast<long long>(report.modified));
     sds_tool_json_int(b, "age_seconds",
                       static_cast<long long>(std::time(nullptr) - report.modified));
@@ -287,17 +359,37 @@ int sds_tool_status(SdsConnection& /*connection*/, int argc, char** /*argv*/) {
   sds_status_report report;
   report.data_dir = sds_path(SDS_DATA_DIR);
   struct stat info {};
+  if (stat(report.data_dir.c_str(), &info) != 0 && (errno == EACCES || errno == EPERM)) {
+    std::fprintf(stderr, "sitedeck: status: permission denied: cannot reach %s\n",
+                 report.data_dir.c_str());
+    return kSdsToolReported;
+  }
   if (stat(report.data_dir.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
     std::fprintf(stderr, "sitedeck: status: no data directory at %s (is the service installed?)\n",
                  report.data_dir.c_str());
     return kSdsToolReported;
   }
   __gather_servers(&report);
-  report.have_etag = __read_small_text(SDS_ETAG_PATH, &report.etag);
+  report.have_etag = __read_small_text(&report, SDS_ETAG_PATH, &report.etag);
   __gather_duration(&report);
+  report.last_pull = sds_tool_read_last_pull(sds_path(SDS_LAST_PULL_PATH));
+  if (report.last_pull.state == sds_last_pull_state::denied) {
+    report.denied.push_back(sds_path(SDS_LAST_PULL_PATH));
+  }
   __gather_location(&report);
   __gather_database(&report);
-  if (sds_tool_output().json) return __print_json(report) ? SDS_ERROR_NONE : kSdsToolReported;
-  __print_text(report, sds_tool_output());
-  return SDS_ERROR_NONE;
+  bool printed = true;
+  if (sds_tool_output().json) {
+    printed = __print_json(report);
+  } else {
+    __print_text(report, sds_tool_output());
+  }
+  if (!report.denied.empty()) {
+    std::fprintf(stderr,
+                 "sitedeck: status: permission denied: %zu file(s) under %s cannot be read "
+                 "by this user (first: %s)\n",
+                 report.denied.size(), report.data_dir.c_str(), report.denied[0].c_str());
+    return kSdsToolReported;
+  }
+  return printed ? SDS_ERROR_NONE : kSdsToolReported;
 }

@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <string>
 
 #include "sitedeck-client.h"
 
@@ -20,8 +21,9 @@ struct sds_tool_command {
   const char* help;
   int (*run)(SdsConnection& connection, int argc, char** argv);
   // Whether the arguments are well formed; checked before connecting, so bad
-  // usage is told (exit 2) whether or not the service is reachable.
-  bool (*arguments_ok)(int argc, char** argv);
+  // usage is told (exit 2) whether or not the service is reachable. When
+  // they are not, `problem` names the argument that is wrong.
+  bool (*arguments_ok)(int argc, char** argv, std::string* problem);
   // Works from the files alone: the driver does not connect, and `run` gets
   // a connection that is not open.
   bool offline = false;
@@ -38,11 +40,11 @@ int sds_tool_render(SdsConnection& connection, int argc, char** argv);
 int sds_tool_status(SdsConnection& connection, int argc, char** argv);
 
 // Argument checks of the subcommands, one per shape of arguments.
-bool sds_tool_no_arguments(int argc, char** argv);
-bool sds_tool_show_arguments(int argc, char** argv);
-bool sds_tool_icon_arguments(int argc, char** argv);
-bool sds_tool_init_arguments(int argc, char** argv);
-bool sds_tool_render_arguments(int argc, char** argv);
+bool sds_tool_no_arguments(int argc, char** argv, std::string* problem);
+bool sds_tool_show_arguments(int argc, char** argv, std::string* problem);
+bool sds_tool_icon_arguments(int argc, char** argv, std::string* problem);
+bool sds_tool_init_arguments(int argc, char** argv, std::string* problem);
+bool sds_tool_render_arguments(int argc, char** argv, std::string* problem);
 
 // Parses a whole decimal item id (0 to INT32_MAX); false for anything else.
 bool sds_tool_parse_id(const char* text, int32_t* id);

@@ -2,9 +2,8 @@
 // one subcommand per request or screenful, so the service can be tried and
 // scripted without a browser. Each subcommand is one row of kCommands; exit
 // status 0 on success, 1 when the service or the connection failed (the
-// status is printed by number, name and meaning), 2 for bad usage.
-#include <sys/socket.h>
-#include <sys/un.h>
+// status is printed by number, name and meaning) or the output could not be
+// written, 2 for bad usage (naming the argument that is wrong).
 #include <unistd.h>
 
 #include <cerrno>
@@ -17,17 +16,14 @@
 
 #include "dlog.h"
 #include "sitedeck-client.h"
-#include "sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 
 namespace {
 
-// A service that does not answer a read within this is given up on.
+// A service that does not greet or answer within this is given up on.
 constexpr int kDefaultTimeoutMs = 10000;
-// The library's reads are tried three times before they give up.
-constexpr int kReadAttempts = 3;
 
 constexpr sds_tool_command kCommands[] = {
     {"hello", "", "connect and print the client id the service issued", sds_tool_hello, sds_tool_no_arguments},
@@ -45,7 +41,7 @@ constexpr sds_tool_command kCommands[] = {
 };
 
 struct sds_tool_options {
-  std::string socket_path = sds_path(SDS_SOCKET_PATH);
+  std::string socket_path = sds_client_socket_path();
   int timeout_ms = kDefaultTimeoutMs;
   bool verbose = false;
   bool json = false;
@@ -53,7 +49,7 @@ struct sds_tool_options {
 };
 
 // What the driver does after reading the options before the command.
-enum class sds_tool_parse { command, help, bad };
+enum class sds_tool_parse { command, help, version, bad };
 
 void __sds_tool_usage(FILE* out) {
   std::fprintf(out,
@@ -61,15 +57,17 @@ void __sds_tool_usage(FILE* out) {
                "Talks to the site deck service the way the browser does.\n\n"
                "options:\n"
                "  --socket PATH   the service's socket (default %s)\n"
-               "  --timeout MS    give up on a reply after MS milliseconds (default %d;\n"
-               "                  0 waits forever; a pull's result is always awaited)\n"
+               "  --timeout MS    give up on the greeting or a reply after MS milliseconds\n"
+               "                  (default %d; 0 waits forever); a pull's result is\n"
+               "                  awaited up to 15 minutes\n"
                "  --json          print one JSON document instead of text\n"
                "  --color=WHEN    colours: auto (on a terminal, unless NO_COLOR is set\n"
                "                  or TERM is dumb), always or never\n"
-               "  --verbose       show the protocol library's log lines\n"
-               "  -h, --help      show this help\n\n"
+               "  --verbose       show the client library's and the file readers' log lines\n"
+               "  -h, --help      show this help\n"
+               "  --version       print the version\n\n"
                "commands:\n",
-               sds_path(SDS_SOCKET_PATH).c_str(), kDefaultTimeoutMs);
+               sds_client_socket_path().c_str(), kDefaultTimeoutMs);
   for (const auto& command : kCommands) {
     std::string synopsis = std::string(command.name) + " " + command.arguments;
     std::fprintf(out, "  %-40s %s\n", synopsis.c_str(), command.help);
@@ -77,12 +75,14 @@ void __sds_tool_usage(FILE* out) {
   std::fprintf(out,
                "  %-40s %s\n\n"
                "Run 'sitedeck help COMMAND' or 'sitedeck COMMAND --help' for one command.\n"
-               "exit status: 0 success, 1 the service or the connection failed, 2 bad usage\n",
+               "exit status: 0 success, 1 the service, the connection or the output failed,\n"
+               "2 bad usage\n",
                "help [COMMAND]", "this help, or the help of COMMAND");
 }
 
-// The one-line usage of a subcommand, after arguments it could not take.
-void __sds_tool_usage_of(const sds_tool_command& command) {
+// What is wrong with the arguments of a subcommand, and its one-line usage.
+void __sds_tool_usage_of(const sds_tool_command& command, const std::string& problem) {
+  if (!problem.empty()) std::fprintf(stderr, "sitedeck: %s: %s\n", command.name, problem.c_str());
   std::fprintf(stderr, "usage: sitedeck %s%s%s\nTry 'sitedeck %s --help' for more information.\n",
                command.name, command.arguments[0] != '\0' ? " " : "", command.arguments,
                command.name);
@@ -132,19 +132,31 @@ sds_tool_parse __sds_tool_parse_options(int argc, char** argv, sds_tool_options*
     } else if (used < 0) {
       __sds_tool_hint("--color takes auto, always or never");
       return sds_tool_parse::bad;
-    } else if (std::strcmp(option, "--socket") == 0 && value != nullptr) {
+    } else if (std::strcmp(option, "--socket") == 0) {
+      if (value == nullptr || value[0] == '\0') {
+        __sds_tool_hint("--socket needs a PATH");
+        return sds_tool_parse::bad;
+      }
       options->socket_path = value;
       at += 2;
-    } else if (std::strcmp(option, "--timeout") == 0 && sds_tool_parse_id(value, &number)) {
+    } else if (std::strcmp(option, "--timeout") == 0) {
+      if (!sds_tool_parse_id(value, &number)) {
+        std::string what = std::string("--timeout needs milliseconds (a whole number), not ") +
+                           (value != nullptr ? value : "nothing");
+        __sds_tool_hint(what.c_str());
+        return sds_tool_parse::bad;
+      }
       options->timeout_ms = number;
       at += 2;
+    } else if (std::strcmp(option, "--version") == 0) {
+      return sds_tool_parse::version;
     } else if (std::strcmp(option, "--verbose") == 0) {
       options->verbose = true;
       at += 1;
     } else if (std::strcmp(option, "--help") == 0 || std::strcmp(option, "-h") == 0) {
       return sds_tool_parse::help;
     } else {
-      std::string what = std::string("unknown or incomplete option ") + option;
+      std::string what = std::string("unknown option ") + option;
       __sds_tool_hint(what.c_str());
       return sds_tool_parse::bad;
     }
@@ -169,50 +181,37 @@ int __sds_tool_help_command(int argc, char** argv) {
   return 0;
 }
 
-// Why connecting failed, in words: the library only says that it did, so
-// the connection is tried once more here to learn the system's reason.
-std::string __sds_tool_unreachable_reason(const std::string& path, int status) {
-  if (status == SDS_ERROR_INVALID_PARAMETER) return "the socket path is too long";
-  struct sockaddr_un address {};
-  address.sun_family = AF_UNIX;
-  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-  UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  if (!fd) return std::strerror(errno);
-  int result = 0;
-  do {
-    result = connect(fd.get(), reinterpret_cast<const struct sockaddr*>(&address), sizeof address);
-  } while (result != 0 && errno == EINTR);
-  if (result == 0) return "the service closed the connection before its greeting";
-  switch (errno) {
-    case ENOENT:
-      return "there is no socket file";
-    case ECONNREFUSED:
-      return "nobody is listening on the socket";
-    case EACCES:
-    case EPERM:
-      return "permission denied";
-    default:
-      return std::strerror(errno);
+void __sds_tool_report_connect(const std::string& path, int status, int error) {
+  if (status == SDS_ERROR_INVALID_PARAMETER) {
+    std::fprintf(stderr, "sitedeck: the socket path %s is too long for a socket\n", path.c_str());
+    return;
   }
-}
-
-void __sds_tool_report_connect(const std::string& path, int status) {
-  // A greeting with a non-zero status is the service refusing the client.
-  if (status != SDS_ERROR_IO_ERROR && status != SDS_ERROR_INVALID_PARAMETER) {
+  // A greeting with a status of the service's is the service refusing.
+  if (status < SDS_CLIENT_ERROR_NO_SOCKET) {
     std::fprintf(stderr, "sitedeck: the service refused the connection: ");
     sds_tool_print_status(stderr, status);
     std::fprintf(stderr, "\n");
     return;
   }
-  std::fprintf(stderr,
-               "sitedeck: cannot reach the site deck service at %s: %s (is the socket unit "
-               "running?)\n",
-               path.c_str(), __sds_tool_unreachable_reason(path, status).c_str());
+  std::string reason = sds_client_status_meaning(status);
+  // The system's words where the system gave the reason.
+  if (error != 0 && status != SDS_CLIENT_ERROR_BUSY) {
+    reason += std::string(" (") + std::strerror(error) + ")";
+  }
+  if (status == SDS_CLIENT_ERROR_NO_SOCKET || status == SDS_CLIENT_ERROR_NOT_LISTENING) {
+    reason += "; is the socket unit running?";
+  } else if (status == SDS_CLIENT_ERROR_BUSY) {
+    reason += "; it serves one connection at a time, try again when that one ends";
+  }
+  std::fprintf(stderr, "sitedeck: cannot reach the site deck service at %s: %s\n", path.c_str(),
+               reason.c_str());
 }
 
-}  // namespace
+void __sds_tool_log_line(void* /*user*/, const char* line) {
+  std::fprintf(stderr, "sitedeck: client library: %s\n", line);
+}
 
-int main(int argc, char** argv) {
+int __sds_tool_main(int argc, char** argv) {
   // A service that goes away must turn into an error message, not a signal.
   (void)std::signal(SIGPIPE, SIG_IGN);
   sds_tool_options options;
@@ -222,9 +221,13 @@ int main(int argc, char** argv) {
     __sds_tool_usage(stdout);
     return 0;
   }
+  if (parsed == sds_tool_parse::version) {
+    std::printf("sitedeck %s\n", SITEDECK_VERSION);
+    return 0;
+  }
   if (parsed == sds_tool_parse::bad) return 2;
   if (index >= argc) {
-    __sds_tool_hint("no command given");
+    __sds_tool_usage(stderr);
     return 2;
   }
   if (std::strcmp(argv[index], "help") == 0) {
@@ -260,26 +263,30 @@ int main(int argc, char** argv) {
       !options.json && sds_tool_decide_color(options.color, isatty(STDOUT_FILENO) == 1,
                                              std::getenv("NO_COLOR"), std::getenv("TERM"));
   output.columns = options.json ? 0 : sds_tool_terminal_columns(STDOUT_FILENO);
-  // The library logs every failed read and write; a person wants one line.
+  // The file readers log every problem they meet; a person wants one line.
   dlog_set_quiet(!options.verbose);
+  if (options.verbose) sds_client_set_log(__sds_tool_log_line, nullptr);
 
   const int command_argc = static_cast<int>(arguments.size()) - 1;
-  if (!command->arguments_ok(command_argc, arguments.data())) {
-    __sds_tool_usage_of(*command);
+  std::string problem;
+  if (!command->arguments_ok(command_argc, arguments.data(), &problem)) {
+    __sds_tool_usage_of(*command, problem);
     return 2;
   }
   SdsConnection connection;
   if (!command->offline) {
-    int read_timeout_ms = (options.timeout_ms + kReadAttempts - 1) / kReadAttempts;
-    int status = sds_client_connect(options.socket_path, &connection, read_timeout_ms);
+    sds_client_timeouts timeouts;
+    timeouts.connect_ms = options.timeout_ms;
+    timeouts.reply_ms = options.timeout_ms;
+    int status = sds_client_connect(options.socket_path, connection, timeouts);
     if (status != SDS_ERROR_NONE) {
-      __sds_tool_report_connect(options.socket_path, status);
+      __sds_tool_report_connect(options.socket_path, status, connection.error_number());
       return 1;
     }
   }
   int status = command->run(connection, command_argc, arguments.data());
   if (status == kSdsToolUsage) {
-    __sds_tool_usage_of(*command);
+    __sds_tool_usage_of(*command, "");
     return 2;
   }
   if (status == kSdsToolReported) return 1;
@@ -289,3 +296,27 @@ int main(int argc, char** argv) {
   }
   return 0;
 }
+
+// What coreutils do at exit: output that could not be written (a full disk,
+// a reader that went away) is a failure of the command, told on stderr.
+int __sds_tool_finish_output(int code) {
+  errno = 0;
+  bool failed = std::fflush(stdout) != 0;
+  failed = std::ferror(stdout) != 0 || failed;
+  int error = errno;
+  if (std::fclose(stdout) != 0 && !failed) {
+    failed = true;
+    error = errno;
+  }
+  if (!failed) return code;
+  if (error != 0) {
+    std::fprintf(stderr, "sitedeck: write error: %s\n", std::strerror(error));
+  } else {
+    std::fprintf(stderr, "sitedeck: write error\n");
+  }
+  return 1;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) { return __sds_tool_finish_output(__sds_tool_main(argc, argv)); }

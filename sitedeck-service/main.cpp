@@ -10,7 +10,9 @@
 
 #include <atomic>
 #include <csignal>
+#include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <new>
 #include <string>
 
@@ -75,7 +77,24 @@ void sds_sigterm_handler(int /*signal_number*/) {
 
 }  // namespace
 
-int main() {
+int main(int argc, char** argv) {
+  // The only arguments: what a person trying the binary by hand asks.
+  if (argc == 2 && std::strcmp(argv[1], "--version") == 0) {
+    std::printf("browser-sitedeck-service %s\n", SITEDECK_VERSION);
+    return 0;
+  }
+  if (argc == 2 && std::strcmp(argv[1], "--help") == 0) {
+    std::printf(
+        "usage: browser-sitedeck-service [--help | --version]\n"
+        "The site deck service of the browser. Not for starting by hand: it is\n"
+        "started by its socket unit (browser-sitedeck-service.socket) for each\n"
+        "connection to %s,\n"
+        "which hands it the listening socket; it serves that one connection and\n"
+        "exits. Without systemd, sitedeck-activator does the same. Talk to it\n"
+        "with the `sitedeck` tool.\n",
+        SDS_SOCKET_PATH);
+    return 0;
+  }
   // The GLib type system initialises itself; nothing to call before the loop.
   sds_main_loop = g_main_loop_new(nullptr, FALSE);
   if (sds_main_loop == nullptr) {

@@ -8,28 +8,9 @@
 #include <cstddef>
 #include <cstdint>
 
-// One result enumeration for the whole program. The numbers are part of the
-// wire protocol (docs/protocol.md): never renumber them.
-enum sds_error_e : int {
-  SDS_ERROR_NONE = 0,
-  SDS_ERROR_IO_ERROR = 1,
-  SDS_ERROR_SHM_FAILED = 2,
-  SDS_ERROR_IO_EAGAIN = 3,
-  SDS_ERROR_IO_EINTR = 4,
-  SDS_ERROR_INVALID_PARAMETER = 5,
-  SDS_ERROR_NO_DATA = 6,
-  SDS_ERROR_OUT_OF_MEMORY = 7,
-  SDS_ERROR_ID_NOT_FOUND = 8,
-  SDS_ERROR_DISK_BUSY = 12,
-  SDS_ERROR_NO_SPACE = 14,
-  SDS_ERROR_DB_OPEN_FAILED = 15,
-  SDS_ERROR_HTTP_OK = 16,
-  SDS_ERROR_HTTP_NOT_MODIFIED = 17,
-  SDS_ERROR_SERVER_REQUEST_FAILED = 18,
-  SDS_ERROR_HTTP_MOVED_PERMANENTLY = 19,
-  SDS_ERROR_HTTP_FOUND = 20,
-  SDS_ERROR_DATA_PULL_FAILED = 21,
-};
+// The one result enumeration of the whole program (SDS_ERROR_*), whose
+// numbers travel as statuses, is defined once for the service and its clients.
+#include "sitedeck-client-status.h"
 
 enum sds_cmd_e : int {
   SDS_CMD_INITIALIZE = 1,

@@ -9,6 +9,7 @@
 #include <memory>
 #include <string>
 
+#include "client/sitedeck-client-internal.h"
 #include "sitedeck-client.h"
 #include "sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"

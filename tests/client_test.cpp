@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstring>
 #include <functional>
 #include <memory>
@@ -17,6 +18,7 @@
 #include <vector>
 
 #include "sitedeck-client-commands.h"
+#include "sitedeck-service-types.h"
 #include "sitedeck-service-paths.h"
 #include "support/socket_pair.h"
 #include "support/temp_root.h"
@@ -124,7 +126,7 @@ class ClientTest : public ::testing::Test {
   void serve(std::function<void(int fd, std::string* received)> script) {
     service_.reset();
     service_ = std::make_unique<ScriptedService>(std::move(script));
-    ASSERT_EQ(sds_client_connect(service_->path(), &connection_, kBoundMs), SDS_ERROR_NONE);
+    ASSERT_EQ(sds_client_connect(service_->path(), connection_, {kBoundMs, kBoundMs}), SDS_ERROR_NONE);
     ASSERT_EQ(connection_.cid(), kClientId);
   }
   // Closes the client's end and returns everything the script received.
@@ -266,7 +268,7 @@ TEST_F(ClientTest, IconRepliesThatDoNotDescribeAFittingImageAreRefused) {
 
 TEST_F(ClientTest, ReplyCutShortClosesTheConnection) {
   serve(exchange({{12, words(0, 10) + "abc"}}, false));  // a ten-byte string, three sent
-  UniqueCStr title;
+  SdsClientText title;
   EXPECT_EQ(sds_client_get_title(connection_, 1, &title), SDS_ERROR_IO_ERROR);
   EXPECT_FALSE(title);
   EXPECT_FALSE(connection_.is_open());
@@ -276,7 +278,7 @@ TEST_F(ClientTest, ReplyCutShortClosesTheConnection) {
 
 TEST_F(ClientTest, NegativeItemIdIsRefusedWithoutSending) {
   serve(exchange({{12, words(0, 600)}}));
-  UniqueCStr url;
+  SdsClientText url;
   int32_t value = 0;
   sds_client_icon icon;
   EXPECT_EQ(sds_client_get_url(connection_, -3, &url), SDS_ERROR_INVALID_PARAMETER);
@@ -295,6 +297,26 @@ TEST_F(ClientTest, ReleaseClosesTheConnectionOnlyWhenTheServiceEndsIt) {
   EXPECT_FALSE(connection_.is_open());
   EXPECT_EQ(service_->finish(),
             words(SDS_CMD_FREE_SHM, kClientId, 0) + words(SDS_CMD_FREE_SHM, kClientId, 0));
+}
+
+// The path follows the service's root rule; the library tells why it failed
+// only to a log callback, and keeps the errno.
+TEST_F(ClientTest, SocketPathFollowsTheRootAndFailuresGoOnlyToTheLogCallback) {
+  EXPECT_EQ(sds_client_socket_path(), sds_path(SDS_SOCKET_PATH));
+  EXPECT_EQ(sds_client_socket_path(), root_.dir() + SDS_CLIENT_SOCKET_PATH);
+  std::vector<std::string> lines;
+  sds_client_set_log(
+      [](void* user, const char* line) {
+        static_cast<std::vector<std::string>*>(user)->push_back(line);
+      },
+      &lines);
+  SdsConnection connection;
+  EXPECT_EQ(sds_client_connect(root_.dir() + "/absent.sock", connection),
+            SDS_CLIENT_ERROR_NO_SOCKET);
+  sds_client_set_log(nullptr, nullptr);
+  EXPECT_EQ(connection.error_number(), ENOENT);
+  EXPECT_EQ(lines, std::vector<std::string>{"connect " + root_.dir() +
+                                            "/absent.sock: No such file or directory"});
 }
 
 }  // namespace

@@ -150,7 +150,7 @@ class DeckCommands : public ::testing::Test {
 TEST_F(DeckCommands, TextAndFlagQueriesAnswerTheStoredValues) {
   struct TextCase {
     const char* name;
-    int (*call)(SdsConnection&, int32_t, UniqueCStr*);
+    int (*call)(SdsConnection&, int32_t, SdsClientText*);
     int32_t id;
     int status;
     const char* value;
@@ -164,7 +164,7 @@ TEST_F(DeckCommands, TextAndFlagQueriesAnswerTheStoredValues) {
       {"unknown id", sds_client_get_url, 99, SDS_ERROR_ID_NOT_FOUND, nullptr},
   };
   for (const auto& c : texts) {
-    UniqueCStr value;
+    SdsClientText value;
     EXPECT_EQ(c.call(connection_, c.id, &value), c.status) << c.name;
     if (c.value != nullptr) {
       ASSERT_TRUE(value) << c.name;
@@ -401,7 +401,7 @@ TEST_F(DeckCommands, NegativeItemIdGetsNoReplyAndTheConnectionGoesOn) {
     expect_nothing_pending();
   }
   // The library does not send what would get no answer.
-  UniqueCStr url;
+  SdsClientText url;
   EXPECT_EQ(sds_client_get_url(connection_, -1, &url), SDS_ERROR_INVALID_PARAMETER);
   expect_nothing_pending();
 }

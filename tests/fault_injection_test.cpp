@@ -16,6 +16,7 @@
 #include <vector>
 
 #include "sitedeck-client-commands.h"
+#include "sitedeck-service-types.h"
 #include "sitedeck-service-paths.h"
 #include "support/db_session.h"
 #include "support/pull_env.h"
@@ -43,7 +44,7 @@ std::vector<std::string> live_items(SdsConnection& connection) {
   if (sds_client_get_ids_by_dirty(connection, 1, &ids) != SDS_ERROR_NONE) return {};
   std::vector<std::string> items;
   for (int32_t i = 0; i < ids.count; ++i) {
-    UniqueCStr url;
+    SdsClientText url;
     if (sds_client_get_url(connection, ids.ids.get()[i], &url) != SDS_ERROR_NONE) return {};
     items.push_back(std::to_string(ids.ids.get()[i]) + "|" + url.get());
   }

@@ -81,7 +81,7 @@ TEST_F(Initialize, FullExchangeRunsThePullAndTheListCanBeRead) {
                                  "SELECT id FROM site_deck WHERE url != "
                                  "'http://old-portal.example/' ORDER BY id"));
   for (int32_t id : sorted) {
-    UniqueCStr url;
+    SdsClientText url;
     ASSERT_EQ(sds_client_get_url(connection_, id, &url), SDS_ERROR_NONE);
     EXPECT_EQ(url.get(),
               rows_of_file(db, "SELECT url FROM site_deck WHERE id = " + std::to_string(id)));

@@ -1,7 +1,8 @@
 // The installation as a package would make it: the files `cmake --install`
 // puts below a staging directory, the units and the tmpfiles.d entry filled
 // in for the prefix, the installed service finding its installed pull
-// module, and systemd's own tools (systemd-tmpfiles, systemd-analyze)
+// module, a program built out of this tree against the installed client
+// library, and systemd's own tools (systemd-tmpfiles, systemd-analyze)
 // accepting what was installed.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -14,6 +15,9 @@
 #include "sitedeck-client-commands.h"
 #include "sitedeck-client.h"
 #include "sitedeck-service-paths.h"
+#include "sitedeck-service-raii.h"
+#include "sitedeck-service-utils.h"
+#include "support/seeded_deck.h"
 #include "support/service_harness.h"
 #include "support/staged_install.h"
 #include "support/temp_root.h"
@@ -24,6 +28,7 @@ namespace fs = std::filesystem;
 
 const std::string kBin = SITEDECK_INSTALL_BINDIR;
 const std::string kModuleDir = SITEDECK_INSTALL_MODULEDIR;
+const std::string kLibDir = SITEDECK_INSTALL_LIBDIR;
 const std::string kShareDir = std::string(SITEDECK_INSTALL_DATADIR) + "/browser-sitedeck-service";
 const std::string kUnitDir = "lib/systemd/system";
 
@@ -33,7 +38,7 @@ std::map<std::string, bool> files_below(const std::string& dir) {
   for (const auto& entry : fs::recursive_directory_iterator(dir)) {
     if (entry.is_directory()) continue;
     bool executable = (entry.status().permissions() & fs::perms::owner_exec) != fs::perms::none;
-    files[fs::relative(entry.path(), dir).string()] = executable;
+    files[entry.path().lexically_relative(dir).string()] = executable;
   }
   return files;
 }
@@ -82,22 +87,37 @@ TEST_F(Packaging, InstallPutsEveryFileInPlaceAndNamesItForEachPrefix) {
     std::map<std::string, bool> expected = {
         {p + kBin + "/browser-sitedeck-service", true},
         {p + kBin + "/sitedeck", true},
+        {p + kBin + "/sitedeck-activator", true},
         {p + kModuleDir + "/libsitedeck-pull.so", false},
+        {p + kLibDir + "/libsitedeck-client.so", false},
+        {p + kLibDir + "/libsitedeck-client.so.1", false},
+        {p + kLibDir + "/libsitedeck-client.so." + SITEDECK_PROJECT_VERSION, false},
+        {p + kLibDir + "/pkgconfig/sitedeck-client.pc", false},
+        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientConfig.cmake", false},
+        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientConfigVersion.cmake", false},
+        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientTargets.cmake", false},
+        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientTargets-" + SITEDECK_BUILD_TYPE_LOWER + ".cmake",
+         false},
         {p + kShareDir + "/site_deck_server_data.xml", false},
         {p + kUnitDir + "/browser-sitedeck-service.socket", false},
         {p + kUnitDir + "/browser-sitedeck-service.service", false},
         {p + "lib/tmpfiles.d/browser-sitedeck-service.conf", false},
     };
+    for (const char* header : {"sitedeck-client.h", "sitedeck-client-commands.h",
+                               "sitedeck-client-deck.h", "sitedeck-client-status.h"}) {
+      expected[p + "include/" + header] = false;
+    }
     // The sample default deck: its item list and every icon it names.
     for (const char* name : {"site_deck_default.json", "news-96.png", "mail-96.png", "maps-96.png",
                              "weather-96.png", "video-96.png", "shop-96.png", "wiki-96.png"}) {
       expected[p + kShareDir + "/default-deck/" + name] = false;
     }
     std::map<std::string, bool> installed = files_below(stage);
-    // The module is loaded, never executed: whether it carries the
+    // Libraries are loaded, never executed: whether they carry the
     // executable bit is the platform's custom.
-    auto module = installed.find(p + kModuleDir + "/libsitedeck-pull.so");
-    if (module != installed.end()) module->second = false;
+    for (auto& [path, executable] : installed) {
+      if (path.find(".so") != std::string::npos) executable = false;
+    }
     EXPECT_EQ(installed, expected);
     // The sample server list is the one in the source tree, byte for byte.
     const std::string server_list = prefix + "/" + kShareDir + "/site_deck_server_data.xml";
@@ -146,6 +166,59 @@ TEST_F(Packaging, InstalledServiceLoadsItsInstalledPullModule) {
   int status = 0;
   ASSERT_TRUE(service.wait_exit(&status));
   EXPECT_EQ(exit_code_of(status), 0) << service.output();
+}
+
+// What a browser developer does: a program of their own, built out of this
+// tree against the installed client library (once with pkg-config, once with
+// find_package), lists the deck of the real service and saves an icon as
+// PNG, which decodes to the stored pixels.
+TEST_F(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
+  const std::string prefix = stage_ + "/usr";
+  const std::string example = std::string(SITEDECK_SOURCE_DIR) + "/client/examples";
+  const std::string flags = SITEDECK_EXAMPLE_FLAGS;
+  const std::string pkg_config = "PKG_CONFIG_PATH=" + prefix + "/" + kLibDir + "/pkgconfig ";
+  const std::string by_pkg_config = root_.dir() + "/deck-icons-pc";
+  const std::string by_cmake = root_.dir() + "/cmake-build";
+  std::vector<std::vector<std::string>> builds = {
+      {"/bin/sh", "-c",
+       std::string(SITEDECK_CXX_COMPILER) + " -std=c++17 " + flags + " -o " + by_pkg_config + " " +
+           example + "/deck-icons.cpp $(" + pkg_config +
+           "pkg-config --cflags --libs sitedeck-client libpng)"},
+      {SITEDECK_CMAKE_COMMAND, "-S", example, "-B", by_cmake, "-DCMAKE_PREFIX_PATH=" + prefix,
+       std::string("-DCMAKE_CXX_COMPILER=") + SITEDECK_CXX_COMPILER, "-DCMAKE_CXX_FLAGS=" + flags},
+      {SITEDECK_CMAKE_COMMAND, "--build", by_cmake},
+  };
+  for (const auto& build : builds) {
+    ProcessResult result = run_process(build, 120000);
+    ASSERT_TRUE(result.finished);
+    ASSERT_EQ(result.exit_code, 0) << build.back() << "\n" << result.out << result.err;
+  }
+
+  SeedItem news = seed_item(7, "https://news.example/", "News", 1);
+  news.icon_data = seed_pixels(4, 3, 7);
+  news.icon_size = "4x3";
+  ASSERT_TRUE(seed_deck({news, seed_item(3, "https://mail.example/", "Mail", 2)}));
+  ServiceHarness service;
+  ASSERT_TRUE(service.start_activated(/*once=*/false));
+  for (const std::string& program : {by_pkg_config, by_cmake + "/deck-icons"}) {
+    SCOPED_TRACE(program);
+    const std::string out_dir = root_.dir() + "/icons-" + fs::path(program).filename().string();
+    fs::create_directories(out_dir);
+    ProcessResult result = run_process(
+        {"/usr/bin/env", "LD_LIBRARY_PATH=" + prefix + "/" + kLibDir, program, out_dir});
+    ASSERT_TRUE(result.finished);
+    EXPECT_EQ(result.exit_code, 0) << result.err;
+    EXPECT_EQ(result.out, "7\tNews\thttps://news.example/\n3\tMail\thttps://mail.example/\n");
+    EXPECT_EQ(files_below(out_dir), (std::map<std::string, bool>{{"7.png", false}}));
+    const std::string png = read_file(out_dir + "/7.png");
+    unsigned char* raw = nullptr;
+    int width = 0, height = 0, size = 0;
+    ASSERT_EQ(convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()),
+                                      png.size(), &raw, &width, &height, &size),
+              0);
+    UniqueMalloc<unsigned char> pixels(raw);
+    EXPECT_EQ(std::vector<uint8_t>(raw, raw + size), seed_pixels(4, 3, 7));
+  }
 }
 
 TEST_F(Packaging, TmpfilesCreatesTheDataDirectoriesAndCopiesTheServerListOnce) {

@@ -84,7 +84,7 @@ class RealWorld : public ::testing::Test {
     sds_client_ids ids;
     if (sds_client_get_ids_by_dirty(connection_, 1, &ids) != SDS_ERROR_NONE) return urls;
     for (int32_t i = 0; i < ids.count; ++i) {
-      UniqueCStr url;
+      SdsClientText url;
       if (sds_client_get_url(connection_, ids.ids.get()[i], &url) != SDS_ERROR_NONE) return {};
       urls.emplace_back(url.get());
     }
@@ -189,7 +189,7 @@ TEST_F(RealWorld, OversizedAndBrokenIconsWereStoredOrNeverFetchedAgain) {
     ASSERT_GT(id, 0);
     sds_client_icon icon;
     EXPECT_EQ(sds_client_get_icon(connection_, id, &icon), SDS_ERROR_NO_DATA);
-    UniqueCStr size;
+    SdsClientText size;
     EXPECT_EQ(sds_client_get_icon_size(connection_, id, &size), SDS_ERROR_NO_DATA);
   }
   EXPECT_TRUE(service_->has_message_matching(
@@ -204,7 +204,7 @@ TEST_F(RealWorld, OversizedAndBrokenIconsWereStoredOrNeverFetchedAgain) {
     SCOPED_TRACE(url);
     sds_client_icon icon;
     ASSERT_EQ(sds_client_get_icon(connection_, id_of(url), &icon), SDS_ERROR_NONE);
-    UniqueCStr size;
+    SdsClientText size;
     ASSERT_EQ(sds_client_get_icon_size(connection_, id_of(url), &size), SDS_ERROR_NONE);
     EXPECT_EQ(std::string(size.get()),
               std::to_string(icon.width) + "x" + std::to_string(icon.height));
@@ -240,7 +240,7 @@ TEST_F(RealWorld, OnlyWebSitesWithTextsTheSocketCarriesJoinTheDeck) {
   ASSERT_TRUE(write_server_list({{1, some.base_url()}}));
   EXPECT_EQ(pull(), SDS_ERROR_NONE);
   EXPECT_EQ(live(), (std::vector<std::string>{"https://long.example/", "http://plain.example/"}));
-  UniqueCStr title;
+  SdsClientText title;
   ASSERT_EQ(sds_client_get_title(connection_, id_of("https://long.example/"), &title),
             SDS_ERROR_NONE);
   EXPECT_STREQ(title.get(), "https://long.example/");

@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "sitedeck-client-page.h"
+#include "sitedeck-tool-page.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-types.h"
 #include "support/temp_root.h"
@@ -18,7 +18,7 @@ namespace {
 
 std::string render(const std::vector<sds_page_tile>& tiles, time_t when = 1796571000) {
   char* html = nullptr;
-  EXPECT_EQ(sds_page_render(tiles.data(), tiles.size(), when, &html), SDS_ERROR_NONE);
+  EXPECT_EQ(sds_page_render(tiles.data(), tiles.size(), {}, when, &html), SDS_ERROR_NONE);
   UniqueCStr owner(html);
   return owner ? owner.get() : "";
 }
@@ -114,7 +114,8 @@ TEST(RenderPage, TilesAreWrittenInOrderWithWhatIsSafeOfEachItem) {
       "<ol class=\"deck\">\n"
       "<li class=\"tile\" data-id=\"20\" style=\"--tile:#e53935;--tile-ink:#000000\">"
       "<a href=\"https://news.example/?a=1&amp;b=2\"><span class=\"icon\"><img alt=\"\" "
-      "src=\"data:image/png;base64,YWJj\"></span><span class=\"title\">News</span></a></li>\n"
+      "src=\"data:image/png;base64,YWJj\"></span><span class=\"title\">News</span>"
+      "<span class=\"host\">news.example</span></a></li>\n"
       "<li class=\"tile\" data-id=\"3\" style=\"--tile:#33cc33;--tile-ink:#000000\"><div>"
       "<span class=\"icon letter\" aria-hidden=\"true\">&lt;</span>"
       "<span class=\"title\">&lt;b&gt;&amp;&quot;&apos;</span></div></li>\n"

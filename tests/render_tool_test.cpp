@@ -168,6 +168,12 @@ TEST_F(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
   ASSERT_EQ(dom.exit_code, 0) << dom.err;
   EXPECT_NE(dom.out.find("<body data-ready=\"\">"), std::string::npos) << dom.out;
   EXPECT_NE(dom.out.find("<span class=\"count\">5 sites</span>"), std::string::npos);
+  // No pull has stored a list in this root; the one withdrawn site is left out.
+  EXPECT_NE(dom.out.find("<span class=\"origin\">from the installed default deck (no pull has "
+                         "stored a list yet)</span> · <span class=\"withdrawn\">1 withdrawn "
+                         "site left out</span>"),
+            std::string::npos)
+      << dom.out;
   EXPECT_EQ(dom.out.find("gone.example"), std::string::npos);
   EXPECT_EQ(dom.out.find("<b>"), std::string::npos) << "a title became markup";
 
@@ -232,8 +238,10 @@ TEST_F(RenderTool, OversizedDeckIsCutToTheFirstThousandTiles) {
 // An empty deck gives a page with no tiles; bad usage and a directory that
 // cannot be made are told and write nothing.
 TEST_F(RenderTool, EmptyDeckBadUsageAndAnUnwritableDirectory) {
-  const std::string usage =
-      "usage: sitedeck render OUT_DIR\nTry 'sitedeck render --help' for more information.\n";
+  auto usage = [](const std::string& problem) {
+    return "sitedeck: render: " + problem +
+           "\nusage: sitedeck render OUT_DIR\nTry 'sitedeck render --help' for more information.\n";
+  };
   ASSERT_TRUE(seed_deck({}));
   ASSERT_TRUE(service_.start_activated(/*once=*/false));
   const std::string file = root_.dir() + "/plain-file", empty = root_.dir() + "/empty";
@@ -244,9 +252,9 @@ TEST_F(RenderTool, EmptyDeckBadUsageAndAnUnwritableDirectory) {
     std::string out, err;
   } cases[] = {
       {{"render", empty}, 0, empty + "/index.html\n", ""},
-      {{"render"}, 2, "", usage},
-      {{"render", "a", "b"}, 2, "", usage},
-      {{"render", "--bogus"}, 2, "", usage},
+      {{"render"}, 2, "", usage("OUT_DIR is missing")},
+      {{"render", "a", "b"}, 2, "", usage("unexpected argument b")},
+      {{"render", "--bogus"}, 2, "", usage("\"--bogus\" is not a directory name")},
       {{"render", file}, 1, "", "sitedeck: render: cannot create " + file + ": Not a directory\n"},
   };
   for (const auto& c : cases) {

@@ -1,7 +1,9 @@
 // `sitedeck status` on scratch roots with the service stopped: a root seeded
-// as a working device leaves it, an empty root, a root with broken files and
-// one without a data directory, as text and as JSON; and that the command
-// changes no file at all, nor creates the database.
+// as a working device leaves it after a good pull, an empty root before any
+// pull, a root with broken files after a failed pull, one whose server
+// directory the user may not read and one without a data directory, as text
+// and as JSON; and that the command changes no file at all, nor creates the
+// database.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <json-glib/json-glib.h>
@@ -29,6 +31,8 @@ namespace {
 
 // 2020-01-01 00:00:00 UTC, the database's time stamp in the seeded root.
 constexpr time_t kDatabaseTime = 1577836800;
+// 2025-12-06 20:00:00 UTC, when the last pull ended in the seeded root.
+constexpr char kPullEnded[] = "1765051200";
 
 // Size and modification time of every file below `dir`, to show that
 // nothing was written.
@@ -84,6 +88,9 @@ class SitedeckStatus : public ::testing::Test {
                            seed_item(3, "https://mail.example/", "Mail", 2), hidden}));
     // After the database: a newly created one drops any stored ETag.
     ASSERT_TRUE(write_file(root_.path(SDS_ETAG_PATH), "\"v1-abc\"\n"));
+    ASSERT_TRUE(write_file(root_.path(SDS_LAST_PULL_PATH),
+                           std::string("time ") + kPullEnded + "\nstatus 0\nstored " + kPullEnded +
+                               "\ncity Jongno-gu\nprovince Seoul\n"));
     struct timespec times[2] = {{kDatabaseTime, 0}, {kDatabaseTime, 0}};
     ASSERT_EQ(utimensat(AT_FDCWD, root_.path(SDS_DB_PATH).c_str(), times, 0), 0);
   }
@@ -115,8 +122,10 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
                            "  2   https://backup.example/deck/  60000 ms  1        yes\n"
                            "stored ETag:    \"v1-abc\"\n"
                            "next update:    3600 s\n"
+                           "last pull:      2025-12-06 20:00:00 UTC, SDS_ERROR_NONE\n"
+                           "next due:       2025-12-06 21:00:00 UTC\n"
                            "last position:  37.500000,127.000000 (Jongno-gu, Seoul)\n"
-                           "items:          2 live, 1 hidden\n"
+                           "items:          2 live, 1 withdrawn\n"
                            "database:       modified ";
   ASSERT_EQ(result.out.substr(0, head.size()), head);
   // The age grows with the clock; its form and the time stamp do not.
@@ -135,22 +144,32 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
          "retry_count": 1, "fall_back": true}],
       "etag": "\"v1-abc\"",
       "next_update": {"stored": "3600", "seconds": 3600},
+      "last_pull": {"time": 1765051200, "status": 0, "name": "SDS_ERROR_NONE"},
+      "next_due": 1765054800, "permission_denied": [],
       "location": {"position": "37.500000,127.000000", "city": "Jongno-gu", "province": "Seoul"},
       "database": {"path": ")" + root_.path(SDS_DB_PATH) +
                                      R"(", "live_items": 2,
-                   "hidden_items": 1, "modified": 1577836800, "age_seconds": 1}})"));
+                   "withdrawn_items": 1, "modified": 1577836800, "age_seconds": 1}})"));
 }
 
 // Missing or broken files are told, not failures; nothing is written and no
-// database is created.
+// database is created. The broken root's last pull failed, in a record whose
+// lines come in another order and with a key of a later version.
 TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
   struct Case {
     const char* name;
     bool broken;
-    std::string next_update, database, stored;  // `stored`: the next update's, as JSON
+    std::string next_update, last_pull, database, stored;  // `stored`: as JSON
+    std::string last_pull_json;
   } cases[] = {
-      {"empty root", false, "none", "", "null"},
-      {"broken files", true, "\"0\" is not above 0", ": file is not a database", "\"0\""},
+      {"empty root", false, "none", "none (no pull has run)", "", "null",
+       R"("last_pull": null, "next_due": null)"},
+      {"broken files", true, "\"0\" is not above 0",
+       "2025-12-06 20:00:00 UTC, SDS_ERROR_SERVER_REQUEST_FAILED\nnext due:       "
+       "2025-12-07 20:00:00 UTC",
+       ": file is not a database", "\"0\"",
+       R"("last_pull": {"time": 1765051200, "status": 18,
+           "name": "SDS_ERROR_SERVER_REQUEST_FAILED"}, "next_due": 1765137600)"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.name);
@@ -159,6 +178,8 @@ TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
       ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "0\n"));
       ASSERT_TRUE(write_file(root_.path(SDS_LOCATION_INFO_PATH), "not xml"));
       ASSERT_TRUE(write_file(root_.path(SDS_DB_PATH), "this is not an SQLite database file"));
+      ASSERT_TRUE(write_file(root_.path(SDS_LAST_PULL_PATH),
+                             std::string("status 18\nattempts 3\ntime ") + kPullEnded + "\n"));
     }
     const auto before = Snapshot(root_.dir());
     ProcessResult result = Status();
@@ -169,6 +190,7 @@ TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
                               "servers:        none (no usable server list at " +
                               root_.path(SDS_SERVER_DATA_XML) + ")\n" + "stored ETag:    none\n" +
                               "next update:    " + c.next_update + " (86400 s is used)\n" +
+                              "last pull:      " + c.last_pull + "\n" +
                               "last position:  none\nitems:          none\n" +
                               "database:       no database at " + root_.path(SDS_DB_PATH) +
                               c.database + "\n");
@@ -176,11 +198,34 @@ TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
     EXPECT_EQ(result.exit_code, 0) << result.err;
     EXPECT_TRUE(IsStatusJson(result.out, R"({"data_directory": ")" + data_ +
                                        R"(", "servers": null, "etag": null, "location": null,
-                                       "database": null, "next_update": {"stored": )" +
+                                       "database": null, "permission_denied": [], )" +
+                                       c.last_pull_json + R"(, "next_update": {"stored": )" +
                                        c.stored + R"(, "seconds": 86400}})"));
     EXPECT_EQ(Snapshot(root_.dir()), before);
     EXPECT_EQ(file_exists(root_.path(SDS_DB_PATH)), c.broken);
   }
+}
+
+// The installation keeps server/ from other users: such a user is told
+// "permission denied" for each file there, never "none", and the command
+// fails.
+TEST_F(SitedeckStatus, FilesTheUserMayNotReadArePermissionDeniedNotMissing) {
+  Seed();
+  ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
+  ASSERT_EQ(chmod(root_.path(SDS_SERVER_DIR).c_str(), 0), 0);
+  std::vector<std::string> argv = {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "status"};
+  ProcessResult result = run_process(without_root(argv));
+  ASSERT_EQ(chmod(root_.path(SDS_SERVER_DIR).c_str(), 0750), 0);
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.exit_code, 1);
+  for (const char* line : {"servers:        permission denied (no usable server list at ",
+                           "stored ETag:    permission denied\n", "last pull:      permission denied\n",
+                           "last position:  permission denied\n"}) {
+    EXPECT_NE(result.out.find(line), std::string::npos) << line << "\n" << result.out;
+  }
+  EXPECT_EQ(result.err, "sitedeck: status: permission denied: 5 file(s) under " + data_ +
+                            " cannot be read by this user (first: " +
+                            root_.path(SDS_SERVER_DATA_XML) + ")\n");
 }
 
 TEST_F(SitedeckStatus, MissingDataDirectoryIsTheOneFailure) {

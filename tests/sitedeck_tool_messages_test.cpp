@@ -1,10 +1,12 @@
 // What the `sitedeck` tool tells a person when things go wrong, without the
-// real service: no socket file, a socket nobody listens on, a stand-in peer
-// that speaks the greeting and answers one request with a chosen status, and
-// bad usage. Also that every subcommand has its help, which needs no service.
+// real service: every reason a connection fails, a stand-in peer that speaks
+// the greeting and answers one request with a chosen status, bad usage and
+// output that cannot be written. Also that every subcommand has its help,
+// which needs no service.
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -90,19 +92,28 @@ class SitedeckToolMessages : public ::testing::Test {
   const std::string socket_ = root_.dir() + "/peer.sock";
 };
 
-// An absent socket, one left behind by a listener that is gone, a peer that
-// hangs up before its greeting, and a greeting that refuses with a status.
+// Every reason a connection can fail before the service says a word: an
+// absent socket, one left behind by a listener that is gone, one closed to
+// the user, a listener that never takes the connection (as the service does
+// while it serves another), a backlog so full that connect() itself waits, a
+// peer that hangs up before its greeting, and a greeting that refuses.
 TEST_F(SitedeckToolMessages, AnUnreachableServiceIsNamedWithTheReasonAndExitsWithOne) {
   const std::string unreachable = "sitedeck: cannot reach the site deck service at " + socket_;
-  const std::string hint = " (is the socket unit running?)\n";
-  enum Peer { kNone, kGone, kHangsUp, kRefuses };
+  const std::string hint = "; is the socket unit running?\n";
+  enum Peer { kNone, kGone, kDenied, kBusy, kFull, kHangsUp, kRefuses };
   struct Case {
     Peer peer;
     std::string err;
   } cases[] = {
-      {kNone, unreachable + ": there is no socket file" + hint},
-      {kGone, unreachable + ": nobody is listening on the socket" + hint},
-      {kHangsUp, unreachable + ": the service closed the connection before its greeting" + hint},
+      {kNone, unreachable + ": there is no socket file (No such file or directory)" + hint},
+      {kGone, unreachable + ": nobody is listening on the socket (Connection refused)" + hint},
+      {kDenied, unreachable + ": permission to use the socket was denied (Permission denied)\n"},
+      {kBusy, unreachable +
+                  ": the service is busy with another connection; it serves one connection at a "
+                  "time, try again when that one ends\n"},
+      {kFull, unreachable +
+                  ": connecting to the service timed out (Resource temporarily unavailable)\n"},
+      {kHangsUp, unreachable + ": the service closed the connection before its greeting\n"},
       {kRefuses,
        "sitedeck: the service refused the connection: 2 SDS_ERROR_SHM_FAILED: the "
        "shared-memory object for icon pixels could not be created, mapped or removed\n"},
@@ -110,14 +121,30 @@ TEST_F(SitedeckToolMessages, AnUnreachableServiceIsNamedWithTheReasonAndExitsWit
   for (const auto& c : cases) {
     SCOPED_TRACE(c.peer);
     ASSERT_TRUE(unlink(socket_.c_str()) == 0 || errno == ENOENT);
-    UniqueFd gone = c.peer == kGone ? BoundSocket(socket_) : UniqueFd();
-    ASSERT_EQ(static_cast<bool>(gone), c.peer == kGone);
+    UniqueFd bound = c.peer >= kGone && c.peer <= kFull ? BoundSocket(socket_) : UniqueFd();
+    // A backlog of 0 holds one waiting connection; the tool's is the second.
+    UniqueFd waiting;
+    if (bound && c.peer != kGone) {
+      ASSERT_EQ(listen(bound.get(), 0), 0);
+    }
+    if (c.peer == kDenied) {
+      ASSERT_EQ(chmod(socket_.c_str(), 0), 0);
+    }
+    if (c.peer == kFull) {
+      waiting = UniqueFd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+      struct sockaddr_un address {};
+      address.sun_family = AF_UNIX;
+      std::memcpy(address.sun_path, socket_.c_str(), socket_.size() + 1);
+      ASSERT_EQ(connect(waiting.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+    }
     std::optional<StandInPeer> peer;
     if (c.peer >= kHangsUp) {
       peer.emplace(socket_, c.peer == kHangsUp ? -1 : SDS_ERROR_SHM_FAILED, -1);
       ASSERT_TRUE(peer->ok());
     }
-    ProcessResult result = sitedeck({"hello"});
+    std::vector<std::string> argv = {std::string(SITEDECK_BIN_DIR) + "/sitedeck", "--socket",
+                                     socket_, "--timeout", "300", "hello"};
+    ProcessResult result = run_process(c.peer == kDenied ? without_root(argv) : argv);
     ASSERT_TRUE(result.finished);
     EXPECT_EQ(result.exit_code, 1);
     EXPECT_EQ(result.out, "");
@@ -199,30 +226,40 @@ TEST_F(SitedeckToolMessages, EverySubcommandHasHelpThatNeedsNoService) {
   }
 }
 
-TEST_F(SitedeckToolMessages, BadUsageIsShortWithAHintAndExitsWithTwo) {
+TEST_F(SitedeckToolMessages, BadUsageNamesTheWrongArgumentAndExitsWithTwo) {
   const std::string hint = "Try 'sitedeck --help' for more information.\n";
-  auto usage = [](const std::string& command, const std::string& synopsis) {
-    return "usage: sitedeck " + command + synopsis + "\nTry 'sitedeck " + command +
-           " --help' for more information.\n";
+  auto usage = [](const std::string& command, const std::string& synopsis,
+                  const std::string& problem) {
+    return "sitedeck: " + command + ": " + problem + "\nusage: sitedeck " + command + synopsis +
+           "\nTry 'sitedeck " + command + " --help' for more information.\n";
   };
+  const std::string init = " --lat LAT --lon LON [--version V]";
   struct Case {
     std::vector<std::string> arguments;
     std::string err;
   } cases[] = {
-      {{}, "sitedeck: no command given\n" + hint},
       {{"frobnicate"}, "sitedeck: unknown command frobnicate\n" + hint},
-      {{"--frobnicate", "list"}, "sitedeck: unknown or incomplete option --frobnicate\n" + hint},
+      {{"--frobnicate", "list"}, "sitedeck: unknown option --frobnicate\n" + hint},
+      {{"--timeout", "soon", "list"},
+       "sitedeck: --timeout needs milliseconds (a whole number), not soon\n" + hint},
       {{"--color=sometimes", "list"}, "sitedeck: --color takes auto, always or never\n" + hint},
       {{"list", "--color"}, "sitedeck: --color takes auto, always or never\n" + hint},
       {{"help", "frobnicate"}, "sitedeck: no help for frobnicate: not a command\n" + hint},
-      {{"status", "extra"}, usage("status", "")},
+      {{"status", "extra"}, usage("status", "", "unexpected argument extra")},
       // No service listens here: the arguments are judged before connecting,
       // so bad usage is never reported as an unreachable service.
-      {{"show", "x"}, usage("show", " ID")},
-      {{"icon", "3"}, usage("icon", " ID -o FILE")},
-      {{"init", "--lat", "1"}, usage("init", " --lat LAT --lon LON [--version V]")},
-      {{"list", "extra"}, usage("list", "")},
-      {{"show", "-1"}, usage("show", " ID")},
+      {{"show", "x"}, usage("show", " ID", "x is not an item id (a whole number from 0)")},
+      {{"show", "-1"}, usage("show", " ID", "-1 is not an item id (a whole number from 0)")},
+      {{"icon", "3"}, usage("icon", " ID -o FILE", "-o FILE is missing")},
+      {{"icon", "3", "-o"}, usage("icon", " ID -o FILE", "-o needs a FILE")},
+      {{"init", "--lat", "1"}, usage("init", init, "--lon LON is missing")},
+      {{"init", "--lat", "north", "--lon", "1"},
+       usage("init", init, "--lat needs degrees (a number), not north")},
+      {{"init", "--lat", "90.5", "--lon", "1"}, usage("init", init, "latitude 90.5 is outside -90..90")},
+      {{"init", "--lat", "1", "--lon", "-181"},
+       usage("init", init, "longitude -181 is outside -180..180")},
+      {{"list", "extra"}, usage("list", "", "unexpected argument extra")},
+      {{"render"}, usage("render", " OUT_DIR", "OUT_DIR is missing")},
   };
   for (const auto& c : cases) {
     ProcessResult result = sitedeck(c.arguments);
@@ -231,6 +268,26 @@ TEST_F(SitedeckToolMessages, BadUsageIsShortWithAHintAndExitsWithTwo) {
     EXPECT_EQ(result.out, "") << c.err;
     EXPECT_EQ(result.err, c.err);
   }
+  // Alone, the tool shows its whole usage.
+  ProcessResult alone = sitedeck({});
+  EXPECT_EQ(alone.exit_code, 2);
+  EXPECT_EQ(alone.err.rfind("usage: sitedeck [OPTIONS] COMMAND [ARGUMENTS]\n", 0), 0u) << alone.err;
+}
+
+// As coreutils do: output that cannot be written (here a full disk) fails the
+// command with a message.
+TEST_F(SitedeckToolMessages, OutputThatCannotBeWrittenExitsWithOne) {
+  const std::string tool = std::string(SITEDECK_BIN_DIR) + "/sitedeck";
+  ProcessResult result = run_process({"/bin/sh", "-c", tool + " --version >/dev/full; echo $?"});
+  ASSERT_TRUE(result.finished);
+  EXPECT_EQ(result.out, "1\n");
+  EXPECT_EQ(result.err, "sitedeck: write error: No space left on device\n");
+  EXPECT_EQ(run_process({tool, "--version"}).out, "sitedeck " SITEDECK_VERSION "\n");
+  const std::string service = std::string(SITEDECK_BIN_DIR) + "/browser-sitedeck-service";
+  EXPECT_EQ(run_process({service, "--version"}).out,
+            "browser-sitedeck-service " SITEDECK_VERSION "\n");
+  EXPECT_NE(run_process({service, "--help"}).out.find("started by its socket unit"),
+            std::string::npos);
 }
 
 }  // namespace

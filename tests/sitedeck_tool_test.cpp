@@ -132,6 +132,16 @@ TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
     EXPECT_EQ(result.out, "") << c.arguments[1];
   }
   EXPECT_FALSE(file_exists(root_.dir() + "/none.png"));
+
+  // The service serves one connection at a time: a second client waits in
+  // the socket's backlog without a greeting, and says so once it gives up.
+  SdsConnection first;
+  ASSERT_EQ(service_.connect(&first), SDS_ERROR_NONE);
+  ProcessResult busy = sitedeck({"--timeout", "300", "hello"});
+  EXPECT_EQ(busy.exit_code, 1);
+  EXPECT_EQ(busy.err, "sitedeck: cannot reach the site deck service at " + service_.socket_path() +
+                          ": the service is busy with another connection; it serves one "
+                          "connection at a time, try again when that one ends\n");
 }
 
 // Whole values and nulls for what is not stored; the option may follow the
@@ -139,10 +149,12 @@ TEST_F(SitedeckTool, FailuresNameTheStatusAndExitWithOne) {
 TEST_F(SitedeckTool, JsonOfListAndShowHasEveryFieldWithNullsForWhatIsNotStored) {
   const std::string news =
       R"({"id": 7, "url": "https://news.example/", "title": "News", "dominant_color": "#AA0000",
-          "icon_size": "4x3", "touch_icon_exists": 1, "favicon_exists": 1)";
+          "icon_size": "4x3", "icon_width": 4, "icon_height": 3, "touch_icon_exists": true,
+          "favicon_exists": true)";
   const std::string mail =
       R"({"id": 3, "url": "https://mail.example/inbox", "title": "Mail", "dominant_color": null,
-          "icon_size": null, "touch_icon_exists": 0, "favicon_exists": 0)";
+          "icon_size": null, "icon_width": null, "icon_height": null,
+          "touch_icon_exists": false, "favicon_exists": false)";
   struct Case {
     std::vector<std::string> arguments;
     std::string json;
@@ -151,8 +163,8 @@ TEST_F(SitedeckTool, JsonOfListAndShowHasEveryFieldWithNullsForWhatIsNotStored) 
        R"({"items": [)" + news + "}, " + mail + "}, " +
            R"({"id": 5, "url": "https://five.example/",
                "title": "A very long title that will not fit the column",
-               "dominant_color": "#00FF00", "icon_size": null, "touch_icon_exists": 0,
-               "favicon_exists": 1}]})"},
+               "dominant_color": "#00FF00", "icon_size": null, "icon_width": null,
+               "icon_height": null, "touch_icon_exists": false, "favicon_exists": true}]})"},
       {{"show", "7", "--json"}, news + R"(, "icon": {"width": 4, "height": 3, "bytes": 48}})"},
       {{"--json", "show", "3"}, mail + R"(, "icon": null})"},
   };

@@ -75,7 +75,7 @@ class Soak : public ::testing::Test {
 // was the expected one.
 bool one_request(SdsConnection& c, long n) {
   const auto id = static_cast<int32_t>(1 + (n / 5) % kItems);
-  UniqueCStr text;
+  SdsClientText text;
   int32_t value = 0;
   sds_client_icon icon;
   sds_client_ids ids;

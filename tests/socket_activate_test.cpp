@@ -122,14 +122,14 @@ TEST(SocketActivate, ServiceUnderSystemdActivationServesOneConnectionAndEnds) {
   ASSERT_TRUE(child.wait_for_output("Listening on " + socket_path)) << child.output();
 
   SdsConnection connection;
-  ASSERT_EQ(sds_client_connect(socket_path, &connection, kBoundMs), SDS_ERROR_NONE)
+  ASSERT_EQ(sds_client_connect(socket_path, connection, {kBoundMs, kBoundMs}), SDS_ERROR_NONE)
       << child.output();
   EXPECT_GT(connection.cid(), 0);
   sds_client_ids ids;
   ASSERT_EQ(sds_client_get_full_ids(connection, &ids), SDS_ERROR_NONE);
   EXPECT_EQ(std::vector<int32_t>(ids.ids.get(), ids.ids.get() + ids.count),
             (std::vector<int32_t>{3, 7}));
-  UniqueCStr title;
+  SdsClientText title;
   ASSERT_EQ(sds_client_get_title(connection, 7, &title), SDS_ERROR_NONE);
   EXPECT_STREQ(title.get(), "Seven");
   int32_t seconds = 0;

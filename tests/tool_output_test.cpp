@@ -6,7 +6,7 @@
 
 #include <string>
 
-#include "sitedeck-client-status-text.h"
+#include "sitedeck-client-status.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool-status.h"
 

@@ -58,5 +58,5 @@ bool BenchSeededService::start() {
 
 int BenchSeededService::connect(size_t index, SdsConnection* out) {
   if (index >= services_.size()) return SDS_ERROR_IO_ERROR;
-  return sds_client_connect(services_[index]->socket_path(), out, 10000);
+  return sds_client_connect(services_[index]->socket_path(), *out, {10000, 10000});
 }

@@ -62,7 +62,7 @@ bool bench_group_queries(const bench_options& options, bench_report* report) {
                      .floor = "floor-url",
                      .body =
                          [client] {
-                           UniqueCStr url;
+                           SdsClientText url;
                            return sds_client_get_url(
                                       client->connection,
                                       BenchSeededService::item_id(client->url_index++),

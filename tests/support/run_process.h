@@ -15,3 +15,7 @@ struct ProcessResult {
 
 // `argv[0]` is the program's path; the environment is the test's own.
 ProcessResult run_process(const std::vector<std::string>& argv, int timeout_ms = 20000);
+
+// `argv` run without root's right to pass file permissions: as the user
+// nobody when the tests run as root, unchanged otherwise.
+std::vector<std::string> without_root(std::vector<std::string> argv);

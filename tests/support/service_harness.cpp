@@ -177,7 +177,10 @@ bool ServiceHarness::wait_until_accepting(int timeout_ms) {
 }
 
 int ServiceHarness::connect(SdsConnection* out, int read_timeout_ms) {
-  return sds_client_connect(socket_path_, out, read_timeout_ms);
+  sds_client_timeouts timeouts;
+  timeouts.connect_ms = read_timeout_ms;
+  timeouts.reply_ms = read_timeout_ms;
+  return sds_client_connect(socket_path_, *out, timeouts);
 }
 
 bool ServiceHarness::signal(int signal_number) {

@@ -203,7 +203,7 @@ int listen_socket() {
 bool one_request(SdsConnection& c, long n) {
   const int32_t cmd = kCommands[n % 5];
   const auto id = static_cast<int32_t>(1 + (n / 5) % kItems);
-  UniqueCStr text;
+  SdsClientText text;
   int32_t value = 0;
   sds_client_icon icon;
   sds_client_ids ids;
@@ -241,7 +241,7 @@ bool one_connection(const Options& o, const std::string& root) {
                         root + "/service-stderr.log", true);
   (void)close(listen_fd);
   SdsConnection c;
-  if (sds_client_connect(sds_path(SDS_SOCKET_PATH), &c, kReadTimeoutMs) != SDS_ERROR_NONE) {
+  if (sds_client_connect(sds_path(SDS_SOCKET_PATH), c, {kReadTimeoutMs, kReadTimeoutMs}) != SDS_ERROR_NONE) {
     die("connect");
   }
   const long every = std::max(1L, o.requests / o.samples);
@@ -299,7 +299,7 @@ bool many_connections(const Options& o, const std::string& root) {
   auto started = std::chrono::steady_clock::now();
   for (long n = 0; n < o.connections; ++n) {
     SdsConnection c;
-    if (sds_client_connect(sds_path(SDS_SOCKET_PATH), &c, kReadTimeoutMs) != SDS_ERROR_NONE) {
+    if (sds_client_connect(sds_path(SDS_SOCKET_PATH), c, {kReadTimeoutMs, kReadTimeoutMs}) != SDS_ERROR_NONE) {
       ++failures;
       continue;
     }

@@ -11,7 +11,7 @@
 // service stores nothing for it (the value then stays empty).
 struct sds_client_item {
   int32_t id = 0;
-  UniqueCStr url, title, dominant_color, icon_size;
+  SdsClientText url, title, dominant_color, icon_size;
   int32_t touch_icon_exists = 0;
   int32_t favicon_exists = 0;
   sds_client_icon icon;
@@ -28,5 +28,6 @@ struct sds_client_item {
 // pixels of item `id` into `item`. Returns SDS_ERROR_NONE when every field
 // was read or had nothing stored; otherwise the first other status (no item
 // with that id gives SDS_ERROR_ID_NOT_FOUND), without reading further.
-int sds_client_read_item(SdsConnection& connection, int32_t id, bool with_icon,
-                         sds_client_item* item);
+// Blocks for up to seven replies.
+SDS_CLIENT_API int sds_client_read_item(SdsConnection& connection, int32_t id, bool with_icon,
+                                        sds_client_item* item);

@@ -1,8 +1,7 @@
-// Names and meanings of the SDS statuses in one table, so that every program
-// built on the client library explains a status the same way.
-#include "sitedeck-client-status-text.h"
-
-#include "sitedeck-service-types.h"
+// Names and meanings of the statuses and the client library's own codes in
+// one table, so that every program built on the library explains a status
+// the same way.
+#include "sitedeck-client-status.h"
 
 namespace {
 
@@ -40,6 +39,19 @@ constexpr sds_status_text kStatusTexts[] = {
      "the content server answered HTTP 302 (found elsewhere)"},
     {SDS_ERROR_DATA_PULL_FAILED, "SDS_ERROR_DATA_PULL_FAILED",
      "the data pull could not run (no server list, request URL or response header file)"},
+    {SDS_CLIENT_ERROR_NO_SOCKET, "SDS_CLIENT_ERROR_NO_SOCKET", "there is no socket file"},
+    {SDS_CLIENT_ERROR_NOT_LISTENING, "SDS_CLIENT_ERROR_NOT_LISTENING",
+     "nobody is listening on the socket"},
+    {SDS_CLIENT_ERROR_PERMISSION_DENIED, "SDS_CLIENT_ERROR_PERMISSION_DENIED",
+     "permission to use the socket was denied"},
+    {SDS_CLIENT_ERROR_BUSY, "SDS_CLIENT_ERROR_BUSY",
+     "the service is busy with another connection"},
+    {SDS_CLIENT_ERROR_TIMED_OUT, "SDS_CLIENT_ERROR_TIMED_OUT",
+     "connecting to the service timed out"},
+    {SDS_CLIENT_ERROR_CLOSED_BEFORE_GREETING, "SDS_CLIENT_ERROR_CLOSED_BEFORE_GREETING",
+     "the service closed the connection before its greeting"},
+    {SDS_CLIENT_ERROR_CONNECT_FAILED, "SDS_CLIENT_ERROR_CONNECT_FAILED",
+     "the socket could not be connected"},
 };
 
 const sds_status_text* __sds_find_status_text(int status) {

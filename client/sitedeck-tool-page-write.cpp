@@ -15,7 +15,7 @@
 #include <new>
 #include <string>
 
-#include "sitedeck-client-page.h"
+#include "sitedeck-tool-page.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-types.h"
 

@@ -43,11 +43,21 @@ char* sds_page_display_title(const char* title, const char* url);
 // malloc'ed. Null only when memory ran out.
 char* sds_page_escape(const char* text);
 
+// Where the deck on the page came from, for its header: `origin` a sentence
+// such as "from a pull for Cape Town, stored ..." (null: not told), and how
+// many withdrawn sites the page leaves out.
+struct sds_page_source {
+  const char* origin = nullptr;
+  size_t withdrawn = 0;
+};
+
 // Builds the page for `count` tiles in the given order, stamped with
-// `rendered_at`. Returns SDS_ERROR_NONE with `*html` malloc'ed (owned by the
-// caller); SDS_ERROR_OUT_OF_MEMORY or SDS_ERROR_INVALID_PARAMETER (no `html`,
-// or no `tiles` for a count above 0) leave it untouched.
-int sds_page_render(const sds_page_tile* tiles, size_t count, time_t rendered_at, char** html);
+// `rendered_at`; each linked tile shows its site's host under its title.
+// Returns SDS_ERROR_NONE with `*html` malloc'ed (owned by the caller);
+// SDS_ERROR_OUT_OF_MEMORY or SDS_ERROR_INVALID_PARAMETER (no `html`, or no
+// `tiles` for a count above 0) leave it untouched.
+int sds_page_render(const sds_page_tile* tiles, size_t count, const sds_page_source& source,
+                    time_t rendered_at, char** html);
 
 // Writes `html` to OUT_DIR/index.html, creating `out_dir` (and its parents)
 // when missing. The page appears whole or not at all: it is written to a

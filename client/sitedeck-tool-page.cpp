@@ -1,7 +1,7 @@
 // Building the start-page preview: validation of what goes into the page
 // (colours, links, texts) and the HTML itself. Everything from the service
 // passes through sds_page_escape or a validator before it reaches the page.
-#include "sitedeck-client-page.h"
+#include "sitedeck-tool-page.h"
 
 #include <glib.h>
 
@@ -55,6 +55,7 @@ constexpr char kStyle[] =
     "font-weight:700}"
     ".title{font-weight:600;text-align:center;overflow-wrap:anywhere;display:-webkit-box;"
     "-webkit-line-clamp:2;-webkit-box-orient:vertical;overflow:hidden}"
+    ".host{font-size:12px;opacity:.8;overflow-wrap:anywhere;text-align:center}"
     ".empty{color:var(--muted);padding:18px 0}";
 
 // Marks each icon with the size it decoded to (data-loaded="WxH", or
@@ -133,11 +134,20 @@ void __append_tile(std::string& out, const sds_page_tile& tile) {
            "</span>";
   }
   out += "<span class=\"title\">" + __escaped(name.get()) + "</span>";
+  if (linked) {
+    // The site's address, under a title that is not the address already.
+    GUriOwner uri(g_uri_parse(tile.url, G_URI_FLAGS_NONE, nullptr));
+    const char* host = uri ? g_uri_get_host(uri.get()) : nullptr;
+    if (host != nullptr && std::strcmp(host, name.get()) != 0) {
+      out += "<span class=\"host\">" + __escaped(host) + "</span>";
+    }
+  }
   out += linked ? "</a>" : "</div>";
   out += "</li>\n";
 }
 
-std::string __build_page(const sds_page_tile* tiles, size_t count, time_t rendered_at) {
+std::string __build_page(const sds_page_tile* tiles, size_t count, const sds_page_source& source,
+                         time_t rendered_at) {
   struct tm when {};
   (void)gmtime_r(&rendered_at, &when);
   char shown[32] = "", stamp[32] = "";
@@ -155,8 +165,16 @@ std::string __build_page(const sds_page_tile* tiles, size_t count, time_t render
       "<title>Site deck</title>\n<style>";
   out += kStyle;
   out += "</style>\n</head>\n<body>\n<header><h1>Site deck</h1><p><span class=\"count\">" + sites +
-         "</span> &middot; rendered <time datetime=\"" + stamp + "\">" + shown +
-         "</time></p></header>\n<main>\n";
+         "</span> &middot; rendered <time datetime=\"" + stamp + "\">" + shown + "</time>";
+  if (source.origin != nullptr) {
+    out += " &middot; <span class=\"origin\">" + __escaped(source.origin) + "</span>";
+  }
+  if (source.withdrawn > 0) {
+    out += " &middot; <span class=\"withdrawn\">" + std::to_string(source.withdrawn) +
+           (source.withdrawn == 1 ? " withdrawn site" : " withdrawn sites") +
+           " left out</span>";
+  }
+  out += "</p></header>\n<main>\n";
   if (count == 0) out += "<p class=\"empty\">The deck has no live sites.</p>\n";
   out += "<ol class=\"deck\">\n";
   for (size_t i = 0; i < count; ++i) __append_tile(out, tiles[i]);
@@ -229,10 +247,11 @@ char* sds_page_escape(const char* text) {
   return strdup(escaped.get());
 }
 
-int sds_page_render(const sds_page_tile* tiles, size_t count, time_t rendered_at, char** html) {
+int sds_page_render(const sds_page_tile* tiles, size_t count, const sds_page_source& source,
+                    time_t rendered_at, char** html) {
   if (html == nullptr || (tiles == nullptr && count > 0)) return SDS_ERROR_INVALID_PARAMETER;
   try {
-    std::string page = __build_page(tiles, count, rendered_at);
+    std::string page = __build_page(tiles, count, source, rendered_at);
     char* copy = strdup(page.c_str());
     if (copy == nullptr) return SDS_ERROR_OUT_OF_MEMORY;
     *html = copy;
