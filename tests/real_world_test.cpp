@@ -116,14 +116,16 @@ TEST_F(RealWorld, PlaceNamesWithSpacesOrBeyondAsciiMadeEveryPullFail) {
     const char* version;
     const char* query;  // as sent, before the signature
     const char* regional_site;
+    const char* city;
+    const char* province;
   } cases[] = {
       {-33.9249, 18.4241, "2.0 beta",
        "platform=Valto&city=City%20of%20Cape%20Town&province=Western%20Cape&"
        "browserversion=2.0%20beta&",
-       "http://cape-point.example/"},
+       "http://cape-point.example/", "City of Cape Town", "Western Cape"},
       {-23.5505, -46.6333, "2.0+1",
        "platform=Valto&city=S%C3%A3o%20Paulo&province=S%C3%A3o%20Paulo&browserversion=2.0%2B1&",
-       "http://paulista.example/"},
+       "http://paulista.example/", "S\u00e3o Paulo", "S\u00e3o Paulo"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.query);
@@ -134,6 +136,12 @@ TEST_F(RealWorld, PlaceNamesWithSpacesOrBeyondAsciiMadeEveryPullFail) {
     const std::vector<std::string> urls = live();
     EXPECT_NE(std::find(urls.begin(), urls.end(), c.regional_site), urls.end());
     close();
+    // The record of the pull names the region of the list it stored.
+    const std::string last = file(SDS_LAST_PULL_PATH);
+    EXPECT_NE(last.find("\nstatus 0\nstored "), std::string::npos) << last;
+    EXPECT_NE(last.find(std::string("\ncity ") + c.city + "\nprovince " + c.province + "\n"),
+              std::string::npos)
+        << last;
   }
 }
 
@@ -168,6 +176,11 @@ TEST_F(RealWorld, PermanentMoveToAnAddressThatNeverAnswersCutTheDeviceOff) {
       << service_->output();
   close();
   EXPECT_EQ(file(SDS_SERVER_DATA_XML), before);
+  // The failed pull is on record; no list was ever stored.
+  const std::string last = file(SDS_LAST_PULL_PATH);
+  EXPECT_EQ(last.substr(0, 5), "time ");
+  EXPECT_NE(last.find("\nstatus 18\n"), std::string::npos) << last;
+  EXPECT_EQ(last.find("stored"), std::string::npos) << last;
 
   ContentServerProcess moved;
   ASSERT_TRUE(moved.ok());
