@@ -13,7 +13,7 @@
 #include "sitedeck-client-deck.h"
 #include "sitedeck-client-status.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 

@@ -15,7 +15,7 @@
 #include "sitedeck-service-raii.h"
 #include "sitedeck-tool-last-pull.h"
 #include "sitedeck-tool-page.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
 #include "sitedeck-tool.h"
 

@@ -22,12 +22,12 @@
 #include <string>
 #include <vector>
 
-#include "sitedeck-service-file-read.h"
+#include "pull/sitedeck-service-file-read.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-request-server.h"
-#include "sitedeck-service-server-data.h"
-#include "sitedeck-service-xml-read.h"
+#include "pull/sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-server-data.h"
+#include "pull/sitedeck-service-xml-read.h"
 #include "sitedeck-client-status.h"
 #include "sitedeck-tool-last-pull.h"
 #include "sitedeck-tool-output.h"

@@ -12,12 +12,12 @@
 #include <set>
 #include <string>
 
-#include "database/sitedeck-service-db-interface.h"
+#include "pull/sitedeck-service-db-merge.h"
 #include "fuzz_support.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-request-server.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-utils.h"
 
 namespace {
 

@@ -7,7 +7,7 @@
 
 #include "fuzz_support.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-server-data.h"
+#include "pull/sitedeck-service-server-data.h"
 
 namespace {
 

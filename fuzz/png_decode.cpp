@@ -8,7 +8,7 @@
 
 #include "fuzz_support.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 
 namespace {
 

@@ -29,11 +29,11 @@
 #include "database/sitedeck-service-db-interface.h"
 #include "fuzz_support.h"
 #include "kdb.h"
-#include "sitedeck-service-main.h"
+#include "serve/sitedeck-service-main.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-shm.h"
-#include "sitedeck-service-utils.h"
+#include "serve/sitedeck-service-shm.h"
+#include "pull/sitedeck-service-utils.h"
 
 namespace {
 

@@ -7,8 +7,8 @@
 
 #include "fuzz_support.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-request-server.h"
-#include "sitedeck-service-server-data.h"
+#include "pull/sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-server-data.h"
 
 namespace {
 

@@ -14,7 +14,7 @@
 #include <optional>
 #include <string>
 
-#include "sitedeck-service-activation.h"
+#include "serve/sitedeck-service-activation.h"
 #include "sitedeck-service-raii.h"
 #include "support/temp_root.h"
 

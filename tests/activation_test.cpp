@@ -11,7 +11,7 @@
 
 #include "client/sitedeck-client-internal.h"
 #include "sitedeck-client.h"
-#include "sitedeck-service-ipc.h"
+#include "serve/sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
 #include "support/service_harness.h"
 #include "support/temp_root.h"

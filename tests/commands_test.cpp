@@ -26,7 +26,7 @@
 #include "kdb.h"
 #include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-request-handler.h"
+#include "serve/sitedeck-service-request-handler.h"
 #include "support/db_session.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"

@@ -12,7 +12,7 @@
 #include <string>
 #include <vector>
 
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 #include "support/stand_in_servers.h"
 
 namespace {

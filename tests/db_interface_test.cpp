@@ -6,8 +6,8 @@
 #include <string>
 #include <vector>
 
-#include "database/sitedeck-service-db-interface.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-db-merge.h"
+#include "pull/sitedeck-service-utils.h"
 #include "support/db_session.h"
 #include "support/items.h"
 #include "support/log_capture.h"

@@ -7,7 +7,7 @@
 
 #include "database/sitedeck-service-db-interface.h"
 #include "database/sitedeck-service-db.h"
-#include "sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-request-server.h"
 #include "support/db_session.h"
 #include "support/items.h"
 #include "support/log_capture.h"

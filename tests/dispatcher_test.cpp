@@ -2,8 +2,8 @@
 
 #include <climits>
 
-#include "sitedeck-service-ipc.h"
-#include "sitedeck-service-request-handler.h"
+#include "serve/sitedeck-service-ipc.h"
+#include "serve/sitedeck-service-request-handler.h"
 #include "support/log_capture.h"
 #include "support/socket_pair.h"
 #include "support/temp_root.h"

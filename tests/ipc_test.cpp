@@ -6,7 +6,7 @@
 #include <string>
 #include <vector>
 
-#include "sitedeck-service-ipc.h"
+#include "serve/sitedeck-service-ipc.h"
 #include "support/log_capture.h"
 #include "support/socket_pair.h"
 

@@ -2,7 +2,7 @@
 
 #include <cstring>
 
-#include "sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-request-server.h"
 
 TEST(ItemList, AppendsInCallOrderAndFreesEverything) {
   sds_item* first = sds_allocate_item_memory();

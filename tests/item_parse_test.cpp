@@ -4,7 +4,7 @@
 #include <vector>
 
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-request-server.h"
 #include "support/log_capture.h"
 #include "support/temp_root.h"
 

@@ -3,8 +3,8 @@
 
 #include <string>
 
-#include "sitedeck-service-json-guard.h"
-#include "sitedeck-service-json-parser.h"
+#include "pull/sitedeck-service-json-guard.h"
+#include "pull/sitedeck-service-json-parser.h"
 #include "support/log_capture.h"
 #include "support/temp_root.h"
 

@@ -9,7 +9,7 @@
 
 #include "kdb.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-request-server.h"
 #include "support/log_capture.h"
 #include "support/pull_env.h"
 #include "support/stand_in_servers.h"

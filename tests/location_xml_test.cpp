@@ -5,8 +5,8 @@
 
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-request-server.h"
-#include "sitedeck-service-server-data.h"
+#include "pull/sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-server-data.h"
 #include "support/log_capture.h"
 #include "support/temp_root.h"
 

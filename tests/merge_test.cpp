@@ -11,10 +11,10 @@
 #include <string>
 #include <vector>
 
-#include "database/sitedeck-service-db-interface.h"
+#include "pull/sitedeck-service-db-merge.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-request-server.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-utils.h"
 #include "support/db_session.h"
 #include "support/items.h"
 #include "support/log_capture.h"

@@ -16,7 +16,7 @@
 #include "sitedeck-client.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
 #include "support/staged_install.h"

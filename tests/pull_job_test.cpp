@@ -12,7 +12,7 @@
 
 #include "kdb.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-request-server.h"
 #include "support/db_session.h"
 #include "support/items.h"
 #include "support/log_capture.h"

@@ -13,7 +13,7 @@
 #include <vector>
 
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 #include "support/png_maker.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"

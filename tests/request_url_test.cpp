@@ -6,7 +6,7 @@
 
 #include "kdb.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-request-server.h"
 #include "support/temp_root.h"
 
 namespace {

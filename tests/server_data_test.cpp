@@ -8,7 +8,7 @@
 #include <vector>
 
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-server-data.h"
+#include "pull/sitedeck-service-server-data.h"
 #include "support/log_capture.h"
 #include "support/temp_root.h"
 

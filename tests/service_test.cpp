@@ -12,8 +12,8 @@
 #include <string>
 #include <vector>
 
-#include "sitedeck-service-ipc.h"
-#include "sitedeck-service-main.h"
+#include "serve/sitedeck-service-ipc.h"
+#include "serve/sitedeck-service-main.h"
 #include "sitedeck-service-paths.h"
 #include "support/log_capture.h"
 #include "support/socket_pair.h"

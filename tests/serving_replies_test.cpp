@@ -14,10 +14,10 @@
 #include <string>
 #include <vector>
 
-#include "sitedeck-service-ipc.h"
+#include "serve/sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-request-handler-internal.h"
-#include "sitedeck-service-shm.h"
+#include "serve/sitedeck-service-request-handler-internal.h"
+#include "serve/sitedeck-service-shm.h"
 #include "support/db_session.h"
 #include "support/log_capture.h"
 #include "support/socket_pair.h"

@@ -13,7 +13,7 @@
 
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-shm.h"
+#include "serve/sitedeck-service-shm.h"
 #include "sitedeck-service-types.h"
 #include "support/log_capture.h"
 

@@ -5,7 +5,7 @@
 #include <string>
 
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-signature.h"
+#include "pull/sitedeck-service-signature.h"
 #include "support/temp_root.h"
 
 namespace {

@@ -20,7 +20,7 @@
 #include <vector>
 
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-server-data.h"
+#include "pull/sitedeck-service-server-data.h"
 #include "support/json_match.h"
 #include "support/pull_env.h"
 #include "support/run_process.h"

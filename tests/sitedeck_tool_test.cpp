@@ -13,7 +13,7 @@
 #include "kdb.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 #include "sitedeck-tool-output.h"
 #include "support/json_match.h"
 #include "support/pull_env.h"

@@ -1,6 +1,6 @@
 #include <gtest/gtest.h>
 
-#include "sitedeck-service-ipc.h"
+#include "serve/sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
 #include "support/temp_root.h"
 

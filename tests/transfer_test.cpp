@@ -15,12 +15,12 @@
 #include <string>
 
 #include "kdb.h"
-#include "sitedeck-service-download-icon.h"
+#include "pull/sitedeck-service-download-icon.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "sitedeck-service-request-server.h"
-#include "sitedeck-service-transfer-limits.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-transfer-limits.h"
+#include "pull/sitedeck-service-utils.h"
 #include "support/db_session.h"
 #include "support/log_capture.h"
 #include "support/pull_env.h"

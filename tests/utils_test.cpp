@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-utils.h"
+#include "pull/sitedeck-service-utils.h"
 #include "support/log_capture.h"
 #include "support/png_maker.h"
 #include "support/temp_root.h"

@@ -30,7 +30,7 @@
 #include "scenarios.h"
 #include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-server-data.h"
+#include "pull/sitedeck-service-server-data.h"
 #include "sitedeck-service-types.h"
 #include "support/pull_env.h"
 #include "support/service_harness.h"

@@ -9,7 +9,7 @@
 
 #include "database/sitedeck-service-db-interface.h"
 #include "database/sitedeck-service-db-stmt.h"
-#include "sitedeck-service-ipc.h"
+#include "database/sitedeck-service-error.h"
 #include "sitedeck-service-log.h"
 #include "sitedeck-service-raii.h"
 

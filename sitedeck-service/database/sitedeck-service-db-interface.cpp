@@ -4,7 +4,7 @@
 // operation reports is logged here by name; the callers get it unchanged.
 #include "database/sitedeck-service-db-interface.h"
 
-#include "sitedeck-service-ipc.h"
+#include "database/sitedeck-service-error.h"
 #include "sitedeck-service-log.h"
 
 sqlite3* sds_db_handle = nullptr;

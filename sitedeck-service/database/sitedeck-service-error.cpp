@@ -1,5 +1,7 @@
 // Names of the SDS result codes, for log lines and for the client tool.
-#include "sitedeck-service-ipc.h"
+#include "database/sitedeck-service-error.h"
+
+#include "sitedeck-service-types.h"
 
 const char* sds_error_string(int code) {
   switch (code) {

@@ -3,7 +3,7 @@
 #include <cstdio>
 #include <cstring>
 
-#include "sitedeck-service-request-server.h"
+#include "pull/sitedeck-service-request-server.h"
 
 sds_item* add_item(const char* url, const char* name, const char* color, int specially_removed) {
   sds_item* item = sds_allocate_item_memory();

@@ -5,7 +5,7 @@
 #include <cstring>
 
 #include "kdb.h"
-#include "sitedeck-service-ipc.h"
+#include "serve/sitedeck-service-ipc.h"
 #include "sitedeck-service-paths.h"
 #include "support/db_session.h"
 #include "support/temp_root.h"
