@@ -159,6 +159,7 @@ TEST_F(PullJob, ServerListDecidesWhoIsAskedHowOften) {
     bool fall_back = false;
   };
   const std::string moved = b_.root_url() + "/";
+  set_stall_seconds(1);
   const struct {
     const char* name;
     Settings a_answers;
@@ -167,6 +168,8 @@ TEST_F(PullJob, ServerListDecidesWhoIsAskedHowOften) {
     const char *a_requests, *b_requests;
     bool a_listed;  // a's address still in the list afterwards
   } cases[] = {
+      {"a stalled answer is given up", {{"body", "stall"}, {"stall_s", "600"}}, {{'a', 1}},
+       SDS_ERROR_SERVER_REQUEST_FAILED, "1", "0", true},
       {"a failing server gets its attempts, then the fall-back server is asked",
        {{"status", "503"}}, {{'a', 3}, {'b', 1, true}}, SDS_ERROR_NONE, "3", "1", true},
       {"not modified ends the pull unasking the next", {{"status", "304"}},
@@ -203,12 +206,54 @@ TEST_F(PullJob, ServerListDecidesWhoIsAskedHowOften) {
             std::string(kQuery) + "&hash=" + stand_in_signature(kQuery));
 }
 
-TEST(Geocoder, RefusingStatusLinesAre18AndNamedInTheLog) {
-  TempRoot root;
-  GeocoderProcess geocoder;
-  ASSERT_TRUE(geocoder.ok());
-  ASSERT_TRUE(kdb_write("db/browser/sitedeck/geocoder_url", geocoder.root_url().c_str()));
-  ASSERT_TRUE(write_file(sds_path(SDS_ETAG_PATH), "\"list-etag\"\r\n"));
+constexpr const char* kStoredEtag = "\"list-etag\"\r\n";
+
+class Geocoder : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_TRUE(geocoder_.ok());
+    ASSERT_TRUE(kdb_write("db/browser/sitedeck/geocoder_url", geocoder_.root_url().c_str()));
+    ASSERT_TRUE(write_file(sds_path(SDS_ETAG_PATH), kStoredEtag));
+  }
+  // The location step for a fresh record: "RESULT CITY/PROVINCE", "-" for a text not set.
+  static std::string resolve(double latitude, double longitude) {
+    sds_server_req_args args{};
+    args.latitude = latitude;
+    args.longitude = longitude;
+    const int result = sds_get_city_and_province(&args);
+    const std::string place = std::to_string(result) + " " + (args.city ? args.city : "-") + "/" +
+                              (args.province ? args.province : "-");
+    std::free(args.city);
+    std::free(args.province);
+    return place;
+  }
+  TempRoot root_;
+  GeocoderProcess geocoder_;
+};
+
+// A new place is asked for exactly, stored, and drops the list's ETag (the
+// list of the old place would be answered 304); the same place is not asked again.
+TEST_F(Geocoder, NewPlaceIsAskedExactlyStoredAndDropsTheListEtag) {
+  EXPECT_EQ(resolve(37.5, 127.0), "0 Gangnam-gu/Seoul");
+  EXPECT_EQ(geocoder_.stats()["last_query"],
+            "prox=37.500000,127.000000&mode=retrieveAddresses&app_id=Vb7Qm2Lx9Tr4Kp6Ws1Nd"
+            "&app_code=Hk3Pz8Rt_Wm5Yc2Nq7Lv4J&gen=1");
+  EXPECT_EQ(root_file_or_none(SDS_LOCATION_INFO_PATH),
+            "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<Location><LatitudeLongitude>37.500000,"
+            "127.000000</LatitudeLongitude><City>Gangnam-gu</City><Province>Seoul</Province>"
+            "</Location>\n");
+  EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), "<none>");
+  EXPECT_EQ(root_file_or_none(SDS_HERE_XML_PATH), "<none>");
+  ASSERT_TRUE(write_file(sds_path(SDS_ETAG_PATH), kStoredEtag));
+  EXPECT_EQ(resolve(37.5000001, 127.0), "0 Gangnam-gu/Seoul");  // the same to six decimals
+  EXPECT_EQ(geocoder_.stats()["request_count"], "1");
+  // An answer without a city stores nothing and keeps the ETag.
+  EXPECT_EQ(resolve(51.5074, -0.1278), "0 -/England");
+  EXPECT_EQ(geocoder_.stats()["request_count"], "2");
+  EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), kStoredEtag);
+}
+
+TEST_F(Geocoder, RefusingStatusLinesAre18AndNamedInTheLog) {
   const struct {
     const char* status;
     std::vector<std::string> logged;  // in this order
@@ -221,16 +266,11 @@ TEST(Geocoder, RefusingStatusLinesAre18AndNamedInTheLog) {
   for (const auto& c : cases) {
     SCOPED_TRACE(c.status);
     // Credentials the geocoder does not know are what gives a real 401.
-    ASSERT_TRUE(geocoder.reset() && (std::string(c.status) == "401"
-                                         ? geocoder.control({{"app_id", "SomeoneElsesAppId123"}})
-                                         : geocoder.control({{"status", c.status}})));
+    ASSERT_TRUE(geocoder_.reset() && (std::string(c.status) == "401"
+                                          ? geocoder_.control({{"app_id", "SomeoneElsesAppId123"}})
+                                          : geocoder_.control({{"status", c.status}})));
     LogCapture log;
-    sds_server_req_args args{};
-    args.latitude = 37.5;
-    args.longitude = 127.0;
-    EXPECT_EQ(sds_get_city_and_province(&args), SDS_ERROR_SERVER_REQUEST_FAILED);
-    EXPECT_EQ(args.city, nullptr);
-    EXPECT_EQ(args.province, nullptr);
+    EXPECT_EQ(resolve(37.5, 127.0), "18 -/-");
     std::vector<std::string> seen;
     for (const LogLine& line : log.lines()) {
       if (line.message.rfind("Here Service", 0) == 0 || line.message.rfind("Check app_", 0) == 0) {
@@ -241,7 +281,7 @@ TEST(Geocoder, RefusingStatusLinesAre18AndNamedInTheLog) {
     // The platform log keeps the leading line feed and drops the final one.
     EXPECT_TRUE(log.contains("\nNot Parsing XML"));
     EXPECT_EQ(root_file_or_none(SDS_LOCATION_INFO_PATH), "<none>");
-    EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), "\"list-etag\"\r\n");
+    EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), kStoredEtag);
   }
 }
 
