@@ -60,8 +60,9 @@ TEST(DbOpen, EveryFileAtTheNameEndsAsAUsableTable) {
   } cases[] = {
       {"first start: no file", [](const std::string&) {}, kDeck, false,
        "database open error(14):unable to open database file"},
-      {"EmptyFileWasNeverGivenTheTable", [](const std::string& db) { ASSERT_TRUE(write_file(db, "")); }, kDeck,
-       false, "no items stored: the stored ETag is dropped"},
+      {"EmptyFileWasNeverGivenTheTable",
+       [](const std::string& db) { ASSERT_TRUE(write_file(db, "")); }, kDeck, false,
+       "no items stored: the stored ETag is dropped"},
       {"a file that is no database, beside a stale journal",
        [](const std::string& db) {
          ASSERT_TRUE(write_file(db, std::string(4096, 'g')));
@@ -201,7 +202,8 @@ Outcome text(int id, const char* column, sqlite3* handle = sds_db_handle, bool o
 Outcome by_url(const char* url, const char* column) {
   return run([&](int* code, std::string* value) {
     char* text = kUntouched;
-    int r = sds_db_get_property_string_for_url(sds_db_handle, url, "site_deck", column, &text, code);
+    int r =
+        sds_db_get_property_string_for_url(sds_db_handle, url, "site_deck", column, &text, code);
     take(text, value);
     return r;
   });
@@ -277,6 +279,7 @@ TEST_F(DbRows, CallsGiveTheirCodesValuesAndLogLines) {
                 kInvalid = SDS_ERROR_INVALID_PARAMETER, kNotFound = SDS_ERROR_ID_NOT_FOUND;
   constexpr const char* kWritten = "Before write finalize, sqlite response code 101";
   constexpr const char* kMaterials = "check materials for query id:1";
+  constexpr const char* kUnprepared = "Before finalize, sqlite response code 1";
   const int64_t big = 5000000000;
   const int one = 1;
   const unsigned char bytes[3] = {9, 0, 9};
@@ -290,11 +293,11 @@ TEST_F(DbRows, CallsGiveTheirCodesValuesAndLogLines) {
       {"text", text(1, "url"), {0, kNone, "https://a.example/", ""}},
       {"null text", text(1, "title"), {0, kNoData, "-", "check column type:5"}},
       {"empty text", text(1, "dominant_color"), {0, kNoData, "-", ""}},
-      {"text of a column not kept", text(1, "icon_path"), {0, kNone, "https://a.example/i.png", ""}},
+      {"column not kept", text(1, "icon_path"), {0, kNone, "https://a.example/i.png", ""}},
       {"real as text", text(1, "order_index"), {0, kNoData, "-", "check column type:2"}},
       {"unknown id", text(99, "url"), {-1, kNotFound, "-", ""}},
       {"id 0", text(0, "url"), {-1, kInvalid, "-", "check id:0"}},
-      {"unknown column", text(1, "nothing"), {-1, kInvalid, "-", "Before finalize, sqlite response code 1"}},
+      {"unknown column", text(1, "nothing"), {-1, kInvalid, "-", kUnprepared}},
       {"no output", text(1, "url", sds_db_handle, false), {-1, kInvalid, "-", kMaterials}},
       {"no connection", text(1, "url", nullptr), {-1, kInvalid, "-", "check connection handle"}},
       {"integer", integer(1, "favicon_exists"), {0, kNone, "1", ""}},
@@ -321,7 +324,7 @@ TEST_F(DbRows, CallsGiveTheirCodesValuesAndLogLines) {
       {"duplicate in an unknown column", run([](int* code, std::string*) {
          return sds_db_check_duplicated_string(sds_db_handle, "site_deck", "nothing", "u", code);
        }),
-       {-1, kInvalid, "-", "Before finalize, sqlite response code 1"}},
+       {-1, kInvalid, "-", kUnprepared}},
       {"new id", run([](int* code, std::string* value) {
          int id = 0;
          int r = sds_db_create_site_deck_id(sds_db_handle, &id, code);
@@ -357,7 +360,8 @@ TEST_F(DbRows, CallsGiveTheirCodesValuesAndLogLines) {
        {-1, kInvalid, "-", kMaterials}},
       {"negative blob length", write_two(1, {"icon_data", "T", -1, SDS_DB_COLUMN_TYPE_BLOB}),
        {-1, kInvalid, "-", kMaterials}},
-      {"unknown value type", write_two(1, {"title", "T", 0, 9}), {-1, kInvalid, "-", "invalid type:9"}},
+      {"unknown value type", write_two(1, {"title", "T", 0, 9}),
+       {-1, kInvalid, "-", "invalid type:9"}},
       {"delete of a URL with quotes", run([](int* code, std::string*) {
          return sds_db_delete_url(sds_db_handle, "x' OR '1'='1", "site_deck", code);
        }),

@@ -92,7 +92,8 @@ TEST_F(PullDownload, FailedIconKeepsTheOldEtagAndAsksAgainInADay) {
   EXPECT_TRUE(log.contains("[CRITICAL]  Failed to Download the Icon"));
   EXPECT_EQ(root_file_or_none(SDS_ETAG_PATH), etag);
   EXPECT_EQ(root_file_or_none(SDS_NEXT_UPDATE_DURATION_PATH), "86400");
-  EXPECT_EQ(DbSession::rows("SELECT count(*) FROM site_deck WHERE url = 'http://garden-life.example/'"),
+  EXPECT_EQ(DbSession::rows("SELECT count(*) FROM site_deck WHERE url = '" + std::string(kGarden) +
+                            "'"),
             "0");
   EXPECT_EQ(first_pixel_hex(kHerald), herald_pixel);
   ASSERT_EQ(rmdir(icon_file.get()), 0);
@@ -121,11 +122,10 @@ TEST(PullDownloadSharedIcon, SecondSiteNamingTheSameIconUrlLostItsIcon) {
            R"(", "size": 57}]})";
   };
   const std::string catalogue = db.root().dir() + "/catalogue.json";
-  ASSERT_TRUE(write_file(catalogue, R"({"sites": [)" +
-                                        site("first", "#102030", "shared/apple-touch-icon.png") +
-                                        "," + site("second", "#102030", "shared/apple-touch-icon.png") +
-                                        "," + site("third", "#708090", "third/apple-touch-icon.png") +
-                                        "]}"));
+  ASSERT_TRUE(write_file(
+      catalogue, R"({"sites": [)" + site("first", "#102030", "shared/apple-touch-icon.png") + "," +
+                     site("second", "#102030", "shared/apple-touch-icon.png") + "," +
+                     site("third", "#708090", "third/apple-touch-icon.png") + "]}"));
   ContentServerProcess content({"--catalogue", catalogue});
   ASSERT_TRUE(content.ok());
   EXPECT_EQ(sds_download_and_parse_json_data(content.signed_url(kQuery).c_str()), SDS_ERROR_NONE);
