@@ -10,6 +10,7 @@
 #include <signal.h>
 #include <sys/mman.h>
 #include <sys/prctl.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -24,6 +25,7 @@
 #include <string>
 #include <vector>
 
+#include "client/sitedeck-client-internal.h"
 #include "database/sitedeck-service-db-interface.h"
 #include "kdb.h"
 #include "serve/sitedeck-service-ipc.h"
@@ -262,20 +264,6 @@ TEST_F(DeckCommands, ReleaseAnswersZeroRemovesTheObjectAndEndsTheConnection) {
   EXPECT_FALSE(file_exists(SDS_SHM_FILE_PATH));
 }
 
-// The worker opens the database before it reads the first header; when that
-// fails the connection ends without a reply to anything.
-TEST(UnopenableDatabase, ServiceAnswersTheHandshakeThenEndsWithoutReply) {
-  TempRoot root;
-  ASSERT_EQ(rmdir(root.path(SDS_DATABASE_DIR).c_str()), 0);
-  ServiceHarness service;
-  ASSERT_TRUE(service.start_activated());
-  SdsConnection connection;
-  ASSERT_EQ(service.connect(&connection), SDS_ERROR_NONE) << service.output();
-  (void)write_all(connection.fd(), words({SDS_CMD_GET_URL, connection.cid(), 1}).data(), 12);
-  EXPECT_TRUE(stream_ends(connection.fd()));
-  EXPECT_EQ(exit_code(service), 0) << service.output();
-}
-
 bool write_sysctl(const char* path, const std::string& value) {
   UniqueFd fd(open(path, O_WRONLY));
   return fd && write(fd.get(), value.data(), value.size()) == static_cast<ssize_t>(value.size());
@@ -419,34 +407,19 @@ TEST_F(ConnectionBounds, UnreadRepliesHeldTheConnectionForEver) {
       "\\[ERROR\\] reply to cmd 10 not read within 200 ms sock:[0-9]+"));
 }
 
-// Without activation the service exits with 1 and makes no socket. SIGTERM
-// ends it at once: before any client through the failed accept (255), while
-// serving by SIGUSR1 with nothing more sent.
-TEST(Activation, WithoutActivationExitsWithOneAndSigtermEndsTheServiceAtOnce) {
+// Without activation the service exits with 1 and makes no socket; SIGTERM
+// before any client ends it through the failed accept, with 255.
+TEST(Activation, WithoutActivationExitsWithOneAndSigtermBeforeAnyClientWith255) {
   TempRoot root;
-  ServiceHarness unactivated;
+  ServiceHarness unactivated, service;
   ASSERT_TRUE(unactivated.start_unactivated());
   EXPECT_EQ(exit_code(unactivated), 1);
   EXPECT_TRUE(unactivated.has_message("[CRITICAL]  Failed to get the socket"));
   EXPECT_FALSE(file_exists(root.path(SDS_SOCKET_PATH)));
-  for (bool serving : {false, true}) {
-    SCOPED_TRACE(serving ? "while serving" : "before any client");
-    ServiceHarness service;
-    ASSERT_TRUE(service.start_direct());
-    SdsConnection connection;
-    ASSERT_TRUE(serving ? service.connect(&connection) == SDS_ERROR_NONE
-                        : service.wait_until_accepting());
-    ASSERT_TRUE(service.signal(SIGTERM));
-    int status = 0;
-    ASSERT_TRUE(service.wait_exit(&status));
-    if (serving) {
-      EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGUSR1) << service.output();
-      EXPECT_TRUE(stream_ends(connection.fd()));
-    } else {
-      EXPECT_EQ(exit_code_of(status), 255) << service.output();
-      EXPECT_TRUE(service.has_message("[CRITICAL] accept Sitedeck service was crashed ?"));
-    }
-  }
+  ASSERT_TRUE(service.start_direct());
+  ASSERT_TRUE(service.wait_until_accepting() && service.signal(SIGTERM));
+  EXPECT_EQ(exit_code(service), 255) << service.output();
+  EXPECT_TRUE(service.has_message("[CRITICAL] accept Sitedeck service was crashed ?"));
 }
 
 // A copy elsewhere, without the module beside it.
@@ -549,41 +522,6 @@ TEST_F(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
   ASSERT_EQ(fcntl(s, F_SETFL, O_NONBLOCK), 0);  // a read that would block is tried three times
   EXPECT_EQ(sds_ipc_recv(s, buffer, sizeof buffer, "probe"), -1);
   EXPECT_EQ(log_.count(format("[IPC.Read] probe exception sock:%d", s)), 3);
-}
-
-// Bad announced lengths leave the bytes after them unread; a peer that goes
-// away gives null or -1 with a log line and never kills the process.
-TEST_F(IpcTest, BadLengthsAndAPeerThatLeavesFailTheReadOnly) {
-  const int s = s_;
-  for (int32_t announced : {4097, 0, -1}) {
-    ASSERT_TRUE(write_int(peer_, announced) && write_int(peer_, 1234));
-    EXPECT_EQ(sds_ipc_read_string(s), nullptr) << announced;
-    EXPECT_TRUE(log_.contains(format("[ERROR] check length:%d sock:%d", announced, s))) << announced;
-    EXPECT_EQ(sds_ipc_read_errorcode(s), 1234) << announced;
-  }
-  {
-    SocketPair cut;
-    ASSERT_TRUE(write_int(cut.peer.get(), 10) && write_all(cut.peer.get(), "abcd", 4));
-    cut.peer.reset();
-    EXPECT_EQ(sds_ipc_read_string(cut.service.get()), nullptr);
-    EXPECT_TRUE(log_.contains(format("[ERROR] closed peer sock:%d", cut.service.get())));
-  }
-  log_.clear();
-  char buffer[200] = {};
-  ASSERT_TRUE(write_all(peer_, buffer, 100));
-  pair_.peer.reset();
-  EXPECT_EQ(sds_ipc_read_blob(s, buffer, sizeof buffer), -1);
-  EXPECT_EQ(log_.count(format("[ERROR] closed peer sock:%d", s)), 1);
-  EXPECT_EQ(sds_ipc_read_string(s), nullptr);
-  EXPECT_TRUE(log_.contains(format("[ERROR] read length:0 sock:%d", s)));
-  EXPECT_EQ(sds_ipc_read_errorcode(s), SDS_ERROR_IO_ERROR);
-  EXPECT_TRUE(log_.contains(format("[ERROR] sds_ipc_read_errorcode closed peer sock:%d", s)));
-  EXPECT_EQ(sds_ipc_read_custom_type(s, buffer, 16), -1);
-  int value = 0;
-  EXPECT_EQ(sds_ipc_read_int(s, &value), -1);
-  EXPECT_EQ(value, -1);
-  EXPECT_EQ(sds_ipc_send_errorcode(s, 0), -1);
-  EXPECT_TRUE(log_.contains(format("[IPC.Write] exception sock:%d [%s]", s, strerror(EPIPE))));
 }
 
 // Every item of a reply to a gone peer was tried and logged, and the handler
@@ -722,6 +660,153 @@ TEST(WorkerTest, AcceptorRefusesMissingContextAndSocketAndReportsAFailedAccept) 
   EXPECT_EQ(sds_main_thread(&context), -1);
   EXPECT_TRUE(log.contains("[CRITICAL] accept Sitedeck service was crashed ?"));
   EXPECT_EQ(context.client.thread, pthread_t{});
+}
+
+// The client library against a scripted peer on a socket pair, its replies
+// queued before the call: the bytes each call sends, replies a real service
+// would not give, and the long wait of initialize.
+class ClientTest : public ::testing::Test {
+ protected:
+  void SetUp() override { open(); }
+  // A fresh connection on a new pair, as if the greeting {0, 77} had come.
+  void open() {
+    connection_.close();
+    pair_ = SocketPair();
+    SdsConnectionAccess::adopt(connection_, pair_.service.release(), 77);
+  }
+  std::string sent() {
+    std::string out;
+    char buffer[256];
+    for (ssize_t n; readable_now(pair_.peer.get()) &&
+                    (n = read(pair_.peer.get(), buffer, sizeof buffer)) > 0;) {
+      out.append(buffer, static_cast<size_t>(n));
+    }
+    return out;
+  }
+  TempRoot root_;
+  SocketPair pair_;
+  SdsConnection connection_;
+};
+
+// Initialize tells the wait with `ticks` and, at tick `release`, queues `result`.
+struct Ticks {
+  int count = 0, release = 0, peer = -1;
+  int32_t result = 0;
+  bool keep_waiting = true;
+};
+
+bool tick(void* user) {
+  auto* t = static_cast<Ticks*>(user);
+  if (++t->count == t->release) (void)write_int(t->peer, t->result);
+  return t->keep_waiting;
+}
+
+// Position, then the version (flag 0, a string) or flag 6 alone; a version
+// the wire can't carry is refused unsent; the first status that is not 0
+// ends the call, and giving up the wait closes the connection.
+TEST_F(ClientTest, InitializeSendsPositionThenVersionAndWaitsOutTheResult) {
+  const double position[2] = {-90, 180};
+  const std::string header = words({SDS_CMD_INITIALIZE, 77, 0}) +
+                             std::string(reinterpret_cast<const char*>(position), sizeof position);
+  const std::string overlong(4097, 'v');
+  struct Case {
+    const char* name;
+    std::string replies;
+    const char* version;
+    Ticks ticks;
+    int status;
+    std::string sent;
+    bool open_after;
+  } cases[] = {
+      {"version, result after two ticks", words({0, 0}), "1.2.3", {0, 2, -1, 17}, 17,
+       header + words({0, 5}) + "1.2.3", true},
+      {"no version", words({0, 0, 0}), nullptr, {}, 0, header + words({6}), true},
+      {"empty version", words({0, 0, 0}), "", {}, 0, header + words({6}), true},
+      {"status 15 first", words({15}), "9", {}, 15, header.substr(0, 12), true},
+      {"gave up waiting", words({0, 0}), nullptr, {0, 0, -1, 0, false}, SDS_ERROR_IO_EINTR,
+       header + words({6}), false},
+      {"overlong version", "", overlong.c_str(), {}, SDS_ERROR_INVALID_PARAMETER, "", true},
+  };
+  for (auto c : cases) {
+    SCOPED_TRACE(c.name);
+    open();
+    ASSERT_TRUE(write_all(pair_.peer.get(), c.replies.data(), c.replies.size()));
+    c.ticks.peer = pair_.peer.get();
+    EXPECT_EQ(sds_client_initialize(connection_, -90, 180, c.version, tick, &c.ticks, 1), c.status);
+    EXPECT_EQ(c.ticks.count, c.ticks.release + (c.ticks.keep_waiting ? 0 : 1));
+    EXPECT_EQ(connection_.is_open(), c.open_after);
+    EXPECT_EQ(sent(), c.sent);
+  }
+}
+
+// An icon reply that does not describe a fitting image is read whole and
+// refused. Ids would follow an out-of-bounds count, and after status 15 the
+// service left the flag unread: the stream can't be trusted any more, nor
+// after a reply cut short, and the connection is closed.
+TEST_F(ClientTest, RepliesThatDoNotFitAreRefusedBeforeAnyAllocation) {
+  const auto icon = [](SdsConnection& c) {
+    sds_client_icon out;
+    int status = sds_client_get_icon(c, 3, &out);
+    return !out.pixels && out.byte_count == 0 ? status : -1;
+  };
+  const auto ids = [](SdsConnection& c) {
+    sds_client_ids out;
+    int status = sds_client_get_full_ids(c, &out);
+    return !out.ids ? status : -1;
+  };
+  const auto title = [](SdsConnection& c) {
+    SdsClientText out;
+    int status = sds_client_get_title(c, 1, &out);
+    return !out ? status : -1;
+  };
+  const std::string icon_sent = words({SDS_CMD_GET_ICON, 77, 3});
+  const std::string ids_sent = words({SDS_CMD_GET_FULL_IDS, 77, 0, 6});
+  struct Case {
+    const char* name;
+    std::string reply;
+    std::function<int(SdsConnection&)> call;
+    int status;
+    std::string sent;
+  } cases[] = {
+      {"icon larger than the shared memory", words({0, 1024 * 769 * 4, 1024, 769}), icon, 5, icon_sent},
+      {"not four bytes per pixel", words({0, 27, 3, 3}), icon, 5, icon_sent},
+      {"zero width", words({0, 0, 0, 5}), icon, 5, icon_sent},
+      {"negative byte count", words({0, -16, -2, 2}), icon, 5, icon_sent},
+      {"id count over the maximum", words({0, SDS_CLIENT_MAX_IDS + 1}), ids, 5, ids_sent},
+      {"negative id count", words({0, -1}), ids, 5, ids_sent},
+      {"status 15", words({SDS_ERROR_DB_OPEN_FAILED}), ids, 15, ids_sent},
+      {"a ten-byte string, three sent", words({0, 10}) + "abc", title, SDS_ERROR_IO_ERROR,
+       words({SDS_CMD_GET_TITLE, 77, 1})},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    open();
+    ASSERT_TRUE(write_all(pair_.peer.get(), c.reply.data(), c.reply.size()));
+    ASSERT_EQ(shutdown(pair_.peer.get(), SHUT_WR), 0);  // nothing more comes
+    EXPECT_EQ(c.call(connection_), c.status);
+    EXPECT_EQ(connection_.is_open(), c.sent == icon_sent);  // an icon reply was read whole
+    EXPECT_EQ(sent(), c.sent);
+  }
+  int32_t seconds = 0;
+  EXPECT_EQ(sds_client_get_next_update_duration(connection_, &seconds), SDS_ERROR_IO_ERROR);
+}
+
+// The path follows the service's root rule; the library tells why it failed
+// only to a log callback, and keeps the errno.
+TEST_F(ClientTest, SocketPathFollowsTheRootAndFailuresGoOnlyToTheLogCallback) {
+  EXPECT_EQ(sds_client_socket_path(), root_.dir() + SDS_CLIENT_SOCKET_PATH);
+  EXPECT_EQ(sds_client_socket_path(), sds_path(SDS_SOCKET_PATH));
+  std::vector<std::string> lines;
+  const auto log = [](void* user, const char* line) {
+    static_cast<std::vector<std::string>*>(user)->push_back(line);
+  };
+  sds_client_set_log(log, &lines);
+  SdsConnection connection;
+  EXPECT_EQ(sds_client_connect(root_.dir() + "/absent.sock", connection), SDS_CLIENT_ERROR_NO_SOCKET);
+  sds_client_set_log(nullptr, nullptr);
+  EXPECT_EQ(connection.error_number(), ENOENT);
+  EXPECT_EQ(lines, std::vector<std::string>{"connect " + root_.dir() +
+                                            "/absent.sock: No such file or directory"});
 }
 
 }  // namespace
