@@ -1,8 +1,10 @@
 // The `sitedeck` command line: against the real service under the activator
-// with a seeded deck (its tables, fields, JSON, colours and PNG icons), after
-// a real pull through the stand-in servers, and without a service (every
-// reason a connection fails, a stand-in peer answering a chosen status, help,
-// bad usage and output that cannot be written).
+// with a seeded deck (tables, fields, JSON, colours, PNG icons, the start-page
+// preview seen by a real headless browser), after a real pull through the
+// stand-in servers, and without a service (every reason a connection fails,
+// a stand-in peer answering a chosen status, help, bad usage, output that
+// cannot be written, `status` on scratch roots).
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <json-glib/json-glib.h>
 #include <poll.h>
@@ -13,6 +15,8 @@
 
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
+#include <map>
 #include <optional>
 #include <regex>
 #include <string>
@@ -20,13 +24,14 @@
 #include <vector>
 
 #include "kdb.h"
+#include "pull/sitedeck-service-server-data.h"
 #include "pull/sitedeck-service-utils.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
 #include "sitedeck-service-types.h"
 #include "sitedeck-tool-output.h"
-#include "sitedeck-tool-status.h"
 #include "support/json_match.h"
+#include "support/png_maker.h"
 #include "support/pull_env.h"
 #include "support/run_process.h"
 #include "support/seeded_deck.h"
@@ -36,12 +41,26 @@
 
 namespace {
 
-const std::string kTool = std::string(SITEDECK_BIN_DIR) + "/sitedeck";
+namespace fs = std::filesystem;
+
+const std::string kTool = SITEDECK_BIN_DIR "/sitedeck";
 
 ProcessResult sitedeck(const std::string& socket, const std::vector<std::string>& arguments) {
   std::vector<std::string> argv = {kTool, "--socket", socket};
   argv.insert(argv.end(), arguments.begin(), arguments.end());
   return run_process(argv);
+}
+
+// A PNG decoded by the service's own code: B,G,R,A bytes, empty on failure.
+std::vector<uint8_t> decoded(const std::string& png) {
+  unsigned char* raw = nullptr;
+  int w = 0, h = 0, size = 0;
+  if (convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()), png.size(), &raw,
+                              &w, &h, &size) != 0) {
+    return {};
+  }
+  UniqueMalloc<unsigned char> owner(raw);
+  return std::vector<uint8_t>(raw, raw + size);
 }
 
 class SitedeckTool : public ::testing::Test {
@@ -141,16 +160,8 @@ TEST_F(SitedeckTool, EveryCommandPrintsExactlyWhatTheServiceHolds) {
     }
   }
   EXPECT_FALSE(file_exists(none));
-  unsigned char* raw = nullptr;
-  int width = 0, height = 0, size = 0;
   const std::string written = read_file(png);
-  ASSERT_EQ(convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(written.data()),
-                                    written.size(), &raw, &width, &height, &size),
-            0);
-  UniqueMalloc<unsigned char> pixels(raw);
-  EXPECT_EQ(width, 4);
-  EXPECT_EQ(height, 3);
-  EXPECT_EQ(std::vector<uint8_t>(raw, raw + size), seed_pixels(4, 3, 7));
+  EXPECT_EQ(decoded(written), seed_pixels(4, 3, 7));
   EXPECT_TRUE(IsJson(sitedeck({"--json", "icon", "7", "-o", png}).out,
                      R"({"file": ")" + png + R"(", "width": 4, "height": 3, "png_bytes": )" +
                          std::to_string(written.size()) + "}"));
@@ -412,16 +423,360 @@ TEST(ToolOutput, ControlCharactersFromTheNetworkCannotReachTheTerminal) {
             "city:            Jongno?" "?-gu\ndominant colour: #0F0\n");
 }
 
-TEST(ToolOutput, AgesInWords) {
+// ---- `sitedeck status` ----
+
+constexpr char kPullEnded[] = "1765051200";  // 2025-12-06 20:00:00 UTC
+
+// Size and modification time of every file below `dir`.
+std::map<std::string, std::pair<uintmax_t, long long>> Snapshot(const std::string& dir) {
+  std::map<std::string, std::pair<uintmax_t, long long>> files;
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(dir)) {
+    struct stat info {};
+    if (stat(entry.path().c_str(), &info) != 0) continue;
+    files[entry.path().string()] = {entry.is_regular_file() ? entry.file_size() : 0,
+                                    info.st_mtim.tv_sec * 1000000000LL + info.st_mtim.tv_nsec};
+  }
+  return files;
+}
+
+// The database's age grows with the clock: above zero, then taken as 1.
+::testing::AssertionResult IsStatusJson(const std::string& text, const std::string& expected) {
+  return IsJson(text, expected, [](JsonNode* printed) {
+    if (!JSON_NODE_HOLDS_OBJECT(printed)) return false;
+    JsonNode* database = json_object_get_member(json_node_get_object(printed), "database");
+    if (database == nullptr || !JSON_NODE_HOLDS_OBJECT(database)) return true;
+    JsonObject* object = json_node_get_object(database);
+    if (json_object_get_int_member(object, "age_seconds") <= 0) return false;
+    json_object_set_int_member(object, "age_seconds", 1);
+    return true;
+  });
+}
+
+class SitedeckStatus : public ::testing::Test {
+ protected:
+  // Time stamps are printed in local time; the tool inherits the zone.
+  void SetUp() override { setenv("TZ", "UTC", 1); }
+  void TearDown() override { unsetenv("TZ"); }
+
+  void Seed() {
+    ASSERT_TRUE(write_server_list({{1, "http://127.0.0.1:8080/", 500, 3, false},
+                                   {2, "https://backup.example/deck/", 60000, 1, true}}));
+    ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "3600"));
+    char city[] = "Jongno-gu", province[] = "Seoul";
+    sds_server_req_args args{};
+    args.latitude = 37.5;
+    args.longitude = 127;
+    args.city = city;
+    args.province = province;
+    save_city_and_province(&args);
+    SeedItem hidden = seed_item(9, "https://gone.example/", "Gone", 3);
+    hidden.is_dirty = -1;
+    ASSERT_TRUE(seed_deck({seed_item(7, "https://news.example/", "News", 1),
+                           seed_item(3, "https://mail.example/", "Mail", 2), hidden}));
+    // After the database: a newly created one drops any stored ETag.
+    ASSERT_TRUE(write_file(root_.path(SDS_ETAG_PATH), "\"v1-abc\"\n"));
+    ASSERT_TRUE(write_file(root_.path(SDS_LAST_PULL_PATH),
+                           std::string("time ") + kPullEnded + "\nstatus 0\nstored " + kPullEnded +
+                               "\ncity Jongno-gu\nprovince Seoul\n"));
+    struct timespec times[2] = {{1577836800, 0}, {1577836800, 0}};  // 2020-01-01 00:00:00 UTC
+    ASSERT_EQ(utimensat(AT_FDCWD, root_.path(SDS_DB_PATH).c_str(), times, 0), 0);
+  }
+  ProcessResult Status(const std::vector<std::string>& options = {}) {
+    std::vector<std::string> argv = {SITEDECK_BIN_DIR "/sitedeck"};
+    argv.insert(argv.end(), options.begin(), options.end());
+    argv.push_back("status");
+    return run_process(argv);
+  }
+
+  TempRoot root_;
+  const std::string data_ = root_.path(SDS_DATA_DIR);
+};
+
+TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
+  Seed();
+  const auto before = Snapshot(root_.dir());
+  ProcessResult result = Status();
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.err, "");
+  const std::string head = "data directory: " + data_ +
+                           "\nservers:        2 configured\n"
+                           "  ID  BASE URL                      WAIT      RETRIES  FALLBACK\n"
+                           "  1   http://127.0.0.1:8080/        500 ms    3        no\n"
+                           "  2   https://backup.example/deck/  60000 ms  1        yes\n"
+                           "stored ETag:    \"v1-abc\"\nnext update:    3600 s\n"
+                           "last pull:      2025-12-06 20:00:00 UTC, SDS_ERROR_NONE\n"
+                           "next due:       2025-12-06 21:00:00 UTC\n"
+                           "last position:  37.500000,127.000000 (Jongno-gu, Seoul)\n"
+                           "items:          2 live, 1 withdrawn\ndatabase:       modified ";
+  ASSERT_EQ(result.out.substr(0, head.size()), head);
+  // The age grows with the clock; its form and the time stamp do not.
+  EXPECT_TRUE(std::regex_match(result.out.substr(head.size()),
+                               std::regex("\\d+ d \\d+ h ago \\(2020-01-01 00:00:00 UTC\\)\n")))
+      << result.out;
+  result = Status({"--json"});
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(Snapshot(root_.dir()), before);
+  EXPECT_TRUE(IsStatusJson(result.out, R"({"data_directory": ")" + data_ + R"(",
+      "servers": [
+        {"id": 1, "base_url": "http://127.0.0.1:8080/", "wait_time_ms": 500, "retry_count": 3,
+         "fall_back": false},
+        {"id": 2, "base_url": "https://backup.example/deck/", "wait_time_ms": 60000,
+         "retry_count": 1, "fall_back": true}],
+      "etag": "\"v1-abc\"", "next_update": {"stored": "3600", "seconds": 3600},
+      "last_pull": {"time": 1765051200, "status": 0, "name": "SDS_ERROR_NONE"},
+      "next_due": 1765054800, "permission_denied": [],
+      "location": {"position": "37.500000,127.000000", "city": "Jongno-gu", "province": "Seoul"},
+      "database": {"path": ")" + root_.path(SDS_DB_PATH) + R"(", "live_items": 2,
+                   "withdrawn_items": 1, "modified": 1577836800, "age_seconds": 1}})"));
+}
+
+// Missing or broken files are told, not failures; the one failure is a
+// missing data directory. The broken root's last pull failed, in a record
+// whose lines come in another order and with a key of a later version.
+TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
   struct Case {
-    long long seconds;
-    const char* text;
+    const char* name;
+    bool broken;
+    std::string next_update, last_pull, database, stored;  // `stored`: as JSON
+    std::string last_pull_json;
   } cases[] = {
-      {-5, "in the future"},      {0, "0 s ago"},         {59, "59 s ago"},
-      {60, "1 min ago"},          {3599, "59 min ago"},   {11520, "3 h 12 min ago"},
-      {86399, "23 h 59 min ago"}, {86400, "1 d 0 h ago"}, {200000, "2 d 7 h ago"},
+      {"empty root", false, "none", "none (no pull has run)", "", "null",
+       R"("last_pull": null, "next_due": null)"},
+      {"broken files", true, "\"0\" is not above 0",
+       "2025-12-06 20:00:00 UTC, SDS_ERROR_SERVER_REQUEST_FAILED\n"
+       "next due:       2025-12-07 20:00:00 UTC",
+       ": file is not a database", "\"0\"",
+       R"("last_pull": {"time": 1765051200, "status": 18,
+           "name": "SDS_ERROR_SERVER_REQUEST_FAILED"}, "next_due": 1765137600)"},
   };
-  for (const auto& c : cases) EXPECT_EQ(sds_tool_format_age(c.seconds), c.text) << c.seconds;
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    if (c.broken) {
+      ASSERT_TRUE(write_file(root_.path(SDS_SERVER_DATA_XML), "<values><Server>"));
+      ASSERT_TRUE(write_file(root_.path(SDS_NEXT_UPDATE_DURATION_PATH), "0\n"));
+      ASSERT_TRUE(write_file(root_.path(SDS_LOCATION_INFO_PATH), "not xml"));
+      ASSERT_TRUE(write_file(root_.path(SDS_DB_PATH), "this is not an SQLite database file"));
+      ASSERT_TRUE(write_file(root_.path(SDS_LAST_PULL_PATH),
+                             std::string("status 18\nattempts 3\ntime ") + kPullEnded + "\n"));
+    }
+    const auto before = Snapshot(root_.dir());
+    ProcessResult result = Status();
+    EXPECT_EQ(result.exit_code, 0) << result.err;
+    EXPECT_EQ(result.err, "");
+    EXPECT_EQ(result.out, "data directory: " + data_ +
+                              "\nservers:        none (no usable server list at " +
+                              root_.path(SDS_SERVER_DATA_XML) + ")\nstored ETag:    none\n" +
+                              "next update:    " + c.next_update + " (86400 s is used)\n" +
+                              "last pull:      " + c.last_pull + "\n" +
+                              "last position:  none\nitems:          none\n" +
+                              "database:       no database at " + root_.path(SDS_DB_PATH) +
+                              c.database + "\n");
+    result = Status({"--json"});
+    EXPECT_TRUE(IsStatusJson(result.out, R"({"data_directory": ")" + data_ +
+                                             R"(", "servers": null, "etag": null, "location": null,
+                                       "database": null, "permission_denied": [], )" +
+                                             c.last_pull_json + R"(, "next_update": {"stored": )" +
+                                             c.stored + R"(, "seconds": 86400}})"));
+    EXPECT_EQ(Snapshot(root_.dir()), before);
+    EXPECT_EQ(file_exists(root_.path(SDS_DB_PATH)), c.broken);
+  }
+  std::filesystem::remove_all(data_);
+  ProcessResult result = Status();
+  EXPECT_EQ(result.exit_code, 1);
+  EXPECT_EQ(result.out, "");
+  EXPECT_EQ(result.err,
+            "sitedeck: status: no data directory at " + data_ + " (is the service installed?)\n");
+}
+
+// The installation keeps server/ from other users: such a user is told
+// "permission denied" for each file there, never "none", and the command fails.
+TEST_F(SitedeckStatus, FilesTheUserMayNotReadArePermissionDeniedNotMissing) {
+  Seed();
+  ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
+  ASSERT_EQ(chmod(root_.path(SDS_SERVER_DIR).c_str(), 0), 0);
+  ProcessResult result = run_process(without_root({SITEDECK_BIN_DIR "/sitedeck", "status"}));
+  ASSERT_EQ(chmod(root_.path(SDS_SERVER_DIR).c_str(), 0750), 0);
+  EXPECT_EQ(result.exit_code, 1);
+  for (const char* line :
+       {"servers:        permission denied (no usable server list at ",
+        "stored ETag:    permission denied\n", "last pull:      permission denied\n",
+        "last position:  permission denied\n"}) {
+    EXPECT_NE(result.out.find(line), std::string::npos) << line << "\n" << result.out;
+  }
+  EXPECT_EQ(result.err, "sitedeck: status: permission denied: 5 file(s) under " + data_ +
+                            " cannot be read by this user (first: " +
+                            root_.path(SDS_SERVER_DATA_XML) + ")\n");
+}
+
+// ---- `sitedeck render` ----
+
+// A tile with stored pixels as the service keeps them after downloading `icon`.
+SeedItem tile(int id, int order, const char* url, std::optional<std::string> title,
+              const char* color, const PngImage* icon = nullptr) {
+  SeedItem item = seed_item(id, url, "", order);
+  item.title = std::move(title);
+  item.dominant_color = color;
+  if (icon != nullptr) {
+    item.icon_data = decoded(png_encode_image(*icon));
+    item.icon_size = std::to_string(icon->width) + "x" + std::to_string(icon->height);
+    item.touch_icon_exists = 1;
+  }
+  return item;
+}
+
+class RenderTool : public ::testing::Test {
+ protected:
+  ProcessResult render(const std::vector<std::string>& arguments) {
+    std::vector<std::string> argv = {SITEDECK_BIN_DIR "/sitedeck", "--socket", service_.socket_path(),
+                                     "render"};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    return run_process(argv);
+  }
+  TempRoot root_;
+  ServiceHarness service_;
+};
+
+TEST_F(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
+  constexpr char kChromium[] = "/usr/bin/chromium";
+  if (access(kChromium, X_OK) != 0) {
+    const char* require = std::getenv("SITEDECK_REQUIRE_BROWSER");
+    if (require != nullptr && std::string(require) == "1") FAIL() << kChromium << " is missing";
+    GTEST_SKIP() << kChromium << " is missing";
+  }
+  // An opaque red icon stays that exact colour when the browser scales it.
+  PngImage red;
+  red.width = red.height = 48;
+  png_fill(red, [](int, int, int c) -> uint16_t { return c == 0 || c == 3 ? 0xff : 0; });
+  const PngImage grey = png_pattern(16, 16, 0, 8), rgba = png_pattern(32, 32, 6, 8),
+                 palette = png_pattern(100, 60, 3, 8), deep = png_pattern(24, 36, 2, 16);
+  // Ids out of step with the order: the page's order can only come from order_index.
+  SeedItem gone = tile(5, 4, "https://gone.example/", "Gone", "#FFEB3B", &rgba);
+  gone.is_dirty = -1;
+  ASSERT_TRUE(seed_deck({tile(20, 1, "https://news.example/", "News", "#E53935", &red),
+                         tile(3, 2, "https://marked.example/", "<b>&\"'", "#1E88E5", &grey),
+                         tile(8, 3, "https://mail.example/inbox", "Mail", "#3c3"), gone,
+                         tile(11, 5, "https://maps.example:8443/x", std::nullopt, "tomato", &palette),
+                         tile(12, 6, "javascript:alert(1)", "Script", "#8E24AA", &deep)}));
+  ASSERT_TRUE(service_.start_activated(/*once=*/false));
+  const std::string page = root_.dir() + "/preview/index.html";
+  ProcessResult rendered = render({root_.dir() + "/preview"});
+  ASSERT_EQ(rendered.exit_code, 0) << rendered.err << service_.output();
+  EXPECT_EQ(rendered.out, page + "\n");
+  EXPECT_EQ(rendered.err, "");
+  // The virtual time budget lets the page load and decode, in the browser's own clock.
+  const auto browse = [&](const std::string& mode) {
+    return run_process({kChromium, "--headless", "--no-sandbox", "--disable-gpu", "--no-first-run",
+                        "--user-data-dir=" + root_.dir() + "/profile", "--disable-extensions",
+                        "--disable-background-networking", "--force-color-profile=srgb",
+                        "--hide-scrollbars", "--window-size=1000,700", "--virtual-time-budget=10000",
+                        mode, "file://" + page},
+                       120000);
+  };
+  ProcessResult dom = browse("--dump-dom");
+  ASSERT_EQ(dom.exit_code, 0) << dom.err;
+  EXPECT_NE(dom.out.find("<body data-ready=\"\">"), std::string::npos) << dom.out;
+  // No pull has stored a list in this root; the one withdrawn site is left out.
+  EXPECT_NE(dom.out.find("<span class=\"count\">5 sites</span>"), std::string::npos);
+  EXPECT_NE(dom.out.find("<span class=\"origin\">from the installed default deck (no pull has "
+                         "stored a list yet)</span> · <span class=\"withdrawn\">1 withdrawn "
+                         "site left out</span>"),
+            std::string::npos);
+  EXPECT_EQ(dom.out.find("gone.example"), std::string::npos);
+  EXPECT_EQ(dom.out.find("<b>"), std::string::npos) << "a title became markup";
+  // Each tile: id, link, icon size once decoded (or a letter instead), title.
+  std::string tiles;
+  const std::string open = "<li class=\"tile\" data-id=\"";
+  for (size_t at = dom.out.find(open), next; at != std::string::npos; at = next) {
+    next = dom.out.find(open, at + 1);
+    const std::string li = dom.out.substr(at, next - at);
+    const auto field = [&li](const char* pattern) {
+      std::smatch m;
+      return std::regex_search(li, m, std::regex(pattern)) ? m[1].str() : "";
+    };
+    tiles += field("data-id=\"([0-9]+)\"") + " " + field("<a href=\"([^\"]*)\"") + " " +
+             (li.find("icon letter") != std::string::npos ? "letter"
+                                                          : field("data-loaded=\"([^\"]*)\"")) +
+             " " + field("<span class=\"title\">([^<]*)</span>") + "\n";
+  }
+  EXPECT_EQ(tiles,
+            "20 https://news.example/ 48x48 News\n"
+            "3 https://marked.example/ 16x16 &lt;b&gt;&amp;\"'\n"
+            "8 https://mail.example/inbox letter Mail\n"
+            "11 https://maps.example:8443/x 100x60 maps.example\n"
+            "12  24x36 Script\n");
+  const std::string shot = root_.dir() + "/shot.png";
+  ASSERT_EQ(browse("--screenshot=" + shot).exit_code, 0);
+  std::map<uint32_t, int> counts;  // pixels of each colour, 0xRRGGBB
+  const std::vector<uint8_t> raw = decoded(read_file(shot));
+  for (size_t i = 0; i + 3 < raw.size(); i += 4) {
+    ++counts[uint32_t{raw[i + 2]} << 16 | uint32_t{raw[i + 1]} << 8 | raw[i]];
+  }
+  ASSERT_FALSE(counts.empty()) << "the screenshot did not decode";
+  // Each live tile's colour fills most of a tile (the unusable "tomato"
+  // gives the neutral grey); the removed site's yellow is nowhere.
+  for (uint32_t colour : {0xe53935u, 0x1e88e5u, 0x33cc33u, 0x5f6368u, 0x8e24aau}) {
+    EXPECT_GE(counts[colour], 2000) << std::hex << colour;
+  }
+  EXPECT_EQ(counts[0xffeb3b], 0);
+  // The red icon shows red at its 56x56 on the page: the stored B,G,R,A bytes
+  // reached the PNG in the right order.
+  EXPECT_GE(counts[0xff0000], 56 * 56 * 3 / 4);
+  EXPECT_EQ(counts[0x0000ff], 0);
+}
+
+TEST_F(RenderTool, OversizedDeckIsCutToTheFirstThousandTiles) {
+  std::vector<SeedItem> items;
+  for (int i = 1; i <= 1001; ++i) {
+    items.push_back(seed_item(i, "https://site" + std::to_string(i) + ".example/", "S", i));
+  }
+  ASSERT_TRUE(seed_deck(items));
+  ASSERT_TRUE(service_.start_activated(/*once=*/false));
+  ProcessResult result = render({root_.dir() + "/big"});
+  EXPECT_EQ(result.exit_code, 0) << result.err;
+  EXPECT_EQ(result.err, "sitedeck: render: the deck has 1001 live sites; the page shows the first 1000\n");
+  std::string page = read_file(root_.dir() + "/big/index.html");
+  EXPECT_NE(page.find("data-id=\"1000\""), std::string::npos);
+  EXPECT_EQ(page.find("data-id=\"1001\""), std::string::npos);
+}
+
+// An empty deck gives a page with no tiles, written again whole (mode 0644,
+// nothing else left in the directory); bad usage and a directory that cannot
+// be made are told and write nothing.
+TEST_F(RenderTool, EmptyDeckBadUsageAndAnUnwritableDirectory) {
+  const auto usage = [](const std::string& problem) {
+    return "sitedeck: render: " + problem +
+           "\nusage: sitedeck render OUT_DIR\nTry 'sitedeck render --help' for more information.\n";
+  };
+  ASSERT_TRUE(seed_deck({}));
+  ASSERT_TRUE(service_.start_activated(/*once=*/false));
+  const std::string file = root_.dir() + "/plain-file", empty = root_.dir() + "/out/empty";
+  ASSERT_TRUE(write_file(file, "x"));
+  struct Case {
+    std::vector<std::string> arguments;
+    int exit_code;
+    std::string out, err;
+  } cases[] = {
+      {{empty}, 0, empty + "/index.html\n", ""},
+      {{empty}, 0, empty + "/index.html\n", ""},
+      {{}, 2, "", usage("OUT_DIR is missing")},
+      {{"a", "b"}, 2, "", usage("unexpected argument b")},
+      {{"--bogus"}, 2, "", usage("\"--bogus\" is not a directory name")},
+      {{file}, 1, "", "sitedeck: render: cannot create " + file + ": Not a directory\n"},
+  };
+  for (const auto& c : cases) {
+    ProcessResult result = render(c.arguments);
+    EXPECT_EQ(result.exit_code, c.exit_code) << c.err;
+    EXPECT_EQ(result.err, c.err);
+    EXPECT_EQ(result.out, c.out);
+  }
+  EXPECT_EQ(read_file(file), "x");
+  const std::string page = read_file(empty + "/index.html");
+  EXPECT_NE(page.find("<span class=\"count\">0 sites</span>"), std::string::npos) << page;
+  EXPECT_EQ(page.find("<li"), std::string::npos);
+  struct stat st {};
+  ASSERT_EQ(stat((empty + "/index.html").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0644u);
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(empty), {}), 1);
 }
 
 }  // namespace
