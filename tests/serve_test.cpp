@@ -19,14 +19,12 @@
 #include <cerrno>
 #include <climits>
 #include <cstring>
-#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <string>
 #include <vector>
 
 #include "client/sitedeck-client-internal.h"
-#include "database/sitedeck-service-db-interface.h"
 #include "kdb.h"
 #include "serve/sitedeck-service-ipc.h"
 #include "serve/sitedeck-service-main.h"
@@ -37,7 +35,6 @@
 #include "sitedeck-service-paths.h"
 #include "support/db_session.h"
 #include "support/log_capture.h"
-#include "support/png_maker.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
 #include "support/socket_pair.h"
@@ -129,8 +126,9 @@ class DeckCommands : public ::testing::Test {
   int fd_ = -1;
 };
 
-// Every query as raw bytes, then nothing pending. A text longer than a string
-// item carries was answered 0 with no string: every later reply was out of step.
+// Queries as raw bytes, then nothing pending (the tool's cases read the rest
+// through the library). A text longer than a string item carries was answered
+// 0 with no string: every later reply was out of step.
 TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
   const auto dirty = [](int32_t is_dirty) {
     return words({0, SITE_DECK_ADAPTOR_O_DIRTY}).substr(0, 6) + words({is_dirty});
@@ -144,14 +142,9 @@ TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
     bool warned = false;
   } cases[] = {
       {"url", SDS_CMD_GET_URL, 1, "", words({0, 20}) + "https://one.example/"},
-      {"title", SDS_CMD_GET_TITLE, 1, "", words({0, 3}) + "One"},
-      {"icon size", SDS_CMD_GET_ICON_SIZE, 1, "", words({0, 3}) + "3x2"},
       {"colour", SDS_CMD_GET_DOMINANT_COLOR, 2, "", words({0, 7}) + "#405060"},
       {"NULL colour: status six alone", SDS_CMD_GET_DOMINANT_COLOR, 3, "", words({6})},
-      {"NULL icon size", SDS_CMD_GET_ICON_SIZE, 2, "", words({6})},
       {"text of an unknown id", SDS_CMD_GET_URL, 99, "", words({SDS_ERROR_ID_NOT_FOUND})},
-      {"touch icon of 1", SDS_CMD_GET_TOUCH_ICON_EXISTS, 1, "", words({0, 1})},
-      {"favicon of 1", SDS_CMD_GET_FAVICON_EXISTS, 1, "", words({0, 0})},
       {"favicon of 2", SDS_CMD_GET_FAVICON_EXISTS, 2, "", words({0, 1})},
       {"flag of withdrawn 3", SDS_CMD_GET_TOUCH_ICON_EXISTS, 3, "", words({0, 1})},
       {"flag of an unknown id", SDS_CMD_GET_FAVICON_EXISTS, 99, "", words({SDS_ERROR_NO_DATA})},
@@ -422,56 +415,12 @@ TEST(Activation, WithoutActivationExitsWithOneAndSigtermBeforeAnyClientWith255) 
   EXPECT_TRUE(service.has_message("[CRITICAL] accept Sitedeck service was crashed ?"));
 }
 
-// A copy elsewhere, without the module beside it.
-TEST(PullModule, BinaryWithoutItsModuleAnswersInitializeWith21AndKeepsServing) {
-  TempRoot root;
-  const std::string copy = root.dir() + "/bin/browser-sitedeck-service";
-  std::filesystem::create_directories(root.dir() + "/bin");
-  std::filesystem::copy_file(SITEDECK_BIN_DIR "/browser-sitedeck-service", copy);
-  ServiceHarness service;
-  service.set_service_path(copy);
-  ASSERT_TRUE(service.start_direct());
-  SdsConnection connection;
-  ASSERT_EQ(service.connect(&connection), SDS_ERROR_NONE) << service.output();
-  EXPECT_EQ(sds_client_initialize(connection, 37.5, 127.25, "1.0"), SDS_ERROR_DATA_PULL_FAILED);
-  int32_t seconds = 0;
-  EXPECT_EQ(sds_client_get_next_update_duration(connection, &seconds), SDS_ERROR_NONE);
-  EXPECT_EQ(seconds, 86400);
-  connection.close();
-  EXPECT_EQ(exit_code(service), 0);
-  EXPECT_TRUE(service.has_message_matching(
-      R"(\[CRITICAL\] cannot load .*/bin/libsitedeck-pull\.so \[.*\])"));
-}
-
 class IpcTest : public ::testing::Test {
  protected:
   SocketPair pair_;
   const int s_ = pair_.service.get(), peer_ = pair_.peer.get();
   LogCapture log_;
 };
-
-// A string goes out as its length and bytes, up to 4096, without a
-// terminator; a blob is read whole across chunks.
-TEST_F(IpcTest, ItemsTravelWholeAsTheirExactBytes) {
-  const std::string longest(4096, 'x');
-  ASSERT_EQ(sds_ipc_send_string(s_, longest.c_str()), 0);
-  UniqueCStr read_back(sds_ipc_read_string(peer_));
-  EXPECT_EQ(std::string(read_back ? read_back.get() : ""), longest);
-  ASSERT_EQ(sds_ipc_send_string(s_, "abc"), 0);
-  sds_command header{3, 42, 7};
-  ASSERT_TRUE(write_int(peer_, SDS_ERROR_NO_DATA));  // the answer, waiting
-  EXPECT_EQ(sds_ipc_simple_response(s_, &header), SDS_ERROR_NO_DATA);
-  EXPECT_EQ(read_bytes(peer_, 19), std::string("\3\0\0\0abc", 7) + words({3, 42, 7}));
-  EXPECT_FALSE(readable_now(peer_));
-  const std::vector<uint8_t> blob = noise_bytes(3000, 1);
-  std::vector<uint8_t> back(3000);
-  ASSERT_TRUE(write_all(peer_, blob.data(), blob.size()) && write_int(peer_, 86400));
-  EXPECT_EQ(sds_ipc_read_blob(s_, back.data(), back.size()), 0);
-  EXPECT_EQ(back, blob);
-  int value = 0;
-  EXPECT_EQ(sds_ipc_read_int(s_, &value), 86400);
-  EXPECT_EQ(value, 86400);
-}
 
 // Bad arguments are refused with their log line and send nothing.
 TEST_F(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
@@ -593,29 +542,6 @@ TEST(DispatcherTest, RefusesWhatItCannotServeAndIgnoresUnknownCommands) {
   EXPECT_FALSE(readable_now(pair.peer.get()));
   pair.peer.reset();
   EXPECT_EQ(sds_handle_requests(&slot, nullptr), SDS_ERROR_IO_ERROR);
-}
-
-// A database that can't be opened by the time a request is dispatched is
-// answered with status 15 alone, and what the request carried stays in the
-// stream. Only the dispatcher can meet that state: the worker never starts
-// serving without a database.
-TEST(UnopenableDatabase, DispatcherAnswersFifteenAndLeavesTheRequestDataUnread) {
-  TempRoot root;
-  DbSession::close_handle();
-  ASSERT_EQ(rmdir(root.path(SDS_DATABASE_DIR).c_str()), 0);
-  SocketPair pair;
-  sds_client slot;
-  slot.client_id = 5;
-  slot.sock = pair.service.get();
-  const std::string condition = words({0, 1}).substr(0, 6) + words({0});  // flag, selector, value
-  ASSERT_TRUE(write_all(pair.peer.get(), condition.data(), condition.size()));
-  sds_command header{SDS_CMD_GET_FULL_IDS, 5, 0};
-  EXPECT_EQ(sds_handle_requests(&slot, &header), SDS_ERROR_DB_OPEN_FAILED);
-  EXPECT_EQ(read_bytes(pair.peer.get(), 4), words({SDS_ERROR_DB_OPEN_FAILED}));
-  EXPECT_FALSE(readable_now(pair.peer.get()));
-  pair.peer.reset();
-  EXPECT_EQ(read_bytes(pair.service.get(), condition.size()), condition);
-  EXPECT_EQ(sds_db_handle, nullptr);
 }
 
 // A quit issued before the main thread enters the loop used to be lost, which
