@@ -1,6 +1,5 @@
-// The real service end to end (raw bytes where they matter, the client
-// library elsewhere), then its serving modules in this process on socket
-// pairs, for the refusals and failures no real client can provoke.
+// The real service end to end, then its serving modules and the client library
+// in this process on socket pairs, for what no real peer can provoke.
 #include <fcntl.h>
 #include <glib.h>
 #include <gtest/gtest.h>
@@ -182,13 +181,15 @@ TEST_F(DeckCommands, RepliesOnTheWireAreExactlyTheirWords) {
     send(cmd, -1);  // a negative item id gets no reply at all
     expect_nothing_pending(3600);
   }
-  EXPECT_TRUE(service_.has_message("[ERROR] title of id:4 is 5000 bytes, not sendable as a string"));
+  EXPECT_TRUE(
+      service_.has_message("[ERROR] title of id:4 is 5000 bytes, not sendable as a string"));
 }
 
 // Pixels go through the object (0666, full size), width before height; one too
 // large is refused uncopied. The client keeps its mapping between icons: the
 // service writes into whatever object now has the name, which it must read.
-TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
+// Release answers 2 while no object has it, 0 once it is removed.
+TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryAndReleaseRemovesTheObject) {
   struct stat st {};
   ASSERT_EQ(stat(SDS_SHM_FILE_PATH, &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0666u);
@@ -214,12 +215,19 @@ TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryWithWidthBeforeHeight) {
   }
   send(SDS_CMD_GET_ICON, 1);
   EXPECT_EQ(read_bytes(fd_, 4), words({SDS_ERROR_SHM_FAILED}));
+  EXPECT_EQ(sds_client_release_shm(connection_), SDS_ERROR_SHM_FAILED);  // and goes on
+  EXPECT_TRUE(service_.has_message("[CRITICAL] Error removing /browser_sds_shm_file"));
   UniqueFd fresh(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT | O_EXCL, 0666));
   ASSERT_EQ(ftruncate(fresh.get(), static_cast<off_t>(SDS_SHM_SIZE)), 0);
   ASSERT_EQ(sds_client_get_icon(connection_, 1, &again), SDS_ERROR_NONE);
   EXPECT_EQ(std::vector<uint8_t>(again.pixels.get(), again.pixels.get() + 24), pixels_);
   EXPECT_EQ(sds_client_get_icon(connection_, 99, &none), SDS_ERROR_NO_DATA);
   EXPECT_FALSE(none.pixels);
+  send(SDS_CMD_FREE_SHM, 0);  // release: 0, the object removed, the connection ended
+  EXPECT_EQ(read_bytes(fd_, 4), words({SDS_ERROR_NONE}));
+  EXPECT_TRUE(stream_ends(fd_));
+  EXPECT_EQ(exit_code(service_), 0) << service_.output();
+  EXPECT_FALSE(file_exists(SDS_SHM_FILE_PATH));
 }
 
 // A client that left with requests unanswered had every item of every reply
@@ -234,22 +242,6 @@ TEST_F(DeckCommands, RepliesToAClientThatLeftWereWrittenAndLoggedItemByItem) {
                           [](const std::string& m) { return m.rfind("[IPC.Write]", 0) == 0; }),
             1)
       << service_.output();
-  EXPECT_TRUE(service_.has_message_matching("disconnect client:[0-9]+ sock:[0-9]+"));
-}
-
-// With the object already gone release answers 2 and the connection goes
-// on; with it there, 0, the object removed and the connection ended.
-TEST_F(DeckCommands, ReleaseAnswersZeroRemovesTheObjectAndEndsTheConnection) {
-  ASSERT_EQ(shm_unlink(SDS_SHM_NAME), 0);
-  EXPECT_EQ(sds_client_release_shm(connection_), SDS_ERROR_SHM_FAILED);
-  expect_nothing_pending();
-  EXPECT_TRUE(service_.has_message("[CRITICAL] Error removing /browser_sds_shm_file"));
-  ASSERT_TRUE(UniqueFd(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT | O_EXCL, 0666)));
-  send(SDS_CMD_FREE_SHM, 0);
-  EXPECT_EQ(read_bytes(fd_, 4), words({SDS_ERROR_NONE}));
-  EXPECT_TRUE(stream_ends(fd_));
-  EXPECT_EQ(exit_code(service_), 0) << service_.output();
-  EXPECT_FALSE(file_exists(SDS_SHM_FILE_PATH));
 }
 
 bool write_sysctl(const char* path, const std::string& value) {
@@ -273,14 +265,12 @@ TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
   ASSERT_TRUE(write_file(target, "kept"));
   constexpr const char* kSwitch = "/proc/sys/fs/protected_regular";
   const struct passwd* nobody = getpwnam("nobody");
-  struct Restore {  // the switch's value before, when it is ours to set
+  struct Restore {  // the switch's value before, when it is ours to set (as root)
     std::string before;
     ~Restore() { EXPECT_TRUE(before.empty() || write_sysctl(kSwitch, before)); }
   } restore;
-  if (geteuid() == 0 && nobody != nullptr && (std::ifstream(kSwitch) >> restore.before) &&
-      !write_sysctl(kSwitch, restore.before)) {
-    restore.before.clear();
-  }
+  if (geteuid() != 0 || nobody == nullptr || !(std::ifstream(kSwitch) >> restore.before) ||
+      !write_sysctl(kSwitch, restore.before)) restore.before.clear();
   struct Case {
     const char* name;
     std::function<int()> make;  // 0 when it stands at the name
@@ -289,14 +279,12 @@ TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
       {"directory", [] { return mkdir(SDS_SHM_FILE_PATH, 0777); }},
       {"FIFO", [] { return mkfifo(SDS_SHM_FILE_PATH, 0666); }},
       {"symlink", [&] { return symlink(target.c_str(), SDS_SHM_FILE_PATH); }},
-      {"object of another account",
-       [&] {
+      {"object of another account", [&] {
          UniqueFd made(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT, 0666));
-         if (!made || restore.before.empty()) return made ? 0 : -1;  // not root: a plain object
-         return fchown(made.get(), nobody->pw_uid, nobody->pw_gid) == 0 &&
-                        write_sysctl(kSwitch, "1")
-                    ? 0
-                    : -1;
+         bool foreign = restore.before.empty() ||  // else a plain object
+                        (fchown(made.get(), nobody->pw_uid, nobody->pw_gid) == 0 &&
+                         write_sysctl(kSwitch, "1"));
+         return made && foreign ? 0 : -1;
        }},
       {"IconAfterTheObjectWasCutShortKilledTheService", [] { return 0; }, true},
   };
@@ -344,33 +332,30 @@ TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
   EXPECT_EQ(read_file(target), "kept");
 }
 
-// Time-outs set short through the platform keys, as an integrator may.
-class ConnectionBounds : public ::testing::Test {
+class ConnectionBounds : public ::testing::Test {  // time-outs set short, as an integrator may
  protected:
   void SetUp() override {
     ASSERT_TRUE(kdb_write("db/browser/sitedeck/request_timeout_ms", "200"));
     ASSERT_TRUE(kdb_write("db/browser/sitedeck/reply_timeout_ms", "200"));
     ASSERT_TRUE(service_.start_activated());
     ASSERT_EQ(service_.connect(&connection_), SDS_ERROR_NONE) << service_.output();
-    fd_ = connection_.fd();
   }
+  int fd() const { return connection_.fd(); }
   TempRoot root_;
   ServiceHarness service_;
   SdsConnection connection_;
-  int fd_ = -1;
 };
 
 // A request that stopped half-way held its connection, and its process, for
 // ever. Between requests the wait stays unbounded: the browser's session.
 TEST_F(ConnectionBounds, HalfSentRequestHeldTheConnectionForEver) {
-  struct pollfd idle = {fd_, POLLIN, 0};
+  struct pollfd idle = {fd(), POLLIN, 0};
   EXPECT_EQ(poll(&idle, 1, 600), 0);  // three times the bound, and nothing
-  const std::string requests = words({SDS_CMD_GET_NEXT_UPDATE_DURATION, connection_.cid(), 0});
-  ASSERT_TRUE(write_all(fd_, requests.data(), 12));
-  EXPECT_EQ(read_bytes(fd_, 8), words({0, SDS_DEFAULT_UPDATE_SECONDS}));
-  ASSERT_TRUE(write_all(fd_, words({SDS_CMD_INITIALIZE, connection_.cid(), 0}).data(), 12));
-  EXPECT_EQ(read_bytes(fd_, 4), words({0}));  // and no position follows
-  EXPECT_TRUE(stream_ends(fd_));
+  ASSERT_TRUE(write_all(fd(), words({10, connection_.cid(), 0}).data(), 12));  // command 10
+  EXPECT_EQ(read_bytes(fd(), 8), words({0, SDS_DEFAULT_UPDATE_SECONDS}));
+  ASSERT_TRUE(write_all(fd(), words({SDS_CMD_INITIALIZE, connection_.cid(), 0}).data(), 12));
+  EXPECT_EQ(read_bytes(fd(), 4), words({0}));  // and no position follows
+  EXPECT_TRUE(stream_ends(fd()));
   EXPECT_EQ(exit_code(service_), 0) << service_.output();
   EXPECT_TRUE(service_.has_message_matching(
       "\\[ERROR\\] cmd 1 not complete within 200 ms sock:[0-9]+"));
@@ -382,10 +367,10 @@ TEST_F(ConnectionBounds, UnreadRepliesHeldTheConnectionForEver) {
   const std::string request = words({SDS_CMD_GET_NEXT_UPDATE_DURATION, connection_.cid(), 0});
   bool ended = false;
   for (int sent = 0; sent < 100000 && !ended; ++sent) {
-    struct pollfd entry = {fd_, POLLOUT, 0};
+    struct pollfd entry = {fd(), POLLOUT, 0};
     ASSERT_EQ(poll(&entry, 1, 10000), 1) << "neither room nor an end";
     ended = (entry.revents & (POLLHUP | POLLERR)) != 0 ||
-            (send(fd_, request.data(), 12, MSG_NOSIGNAL | MSG_DONTWAIT) < 0 && errno != EAGAIN);
+            (send(fd(), request.data(), 12, MSG_NOSIGNAL | MSG_DONTWAIT) < 0 && errno != EAGAIN);
   }
   EXPECT_TRUE(ended);
   EXPECT_EQ(exit_code(service_), 0) << service_.output();
@@ -408,16 +393,11 @@ TEST(Activation, WithoutActivationExitsWithOneAndSigtermBeforeAnyClientWith255) 
   EXPECT_TRUE(service.has_message("[CRITICAL] accept Sitedeck service was crashed ?"));
 }
 
-class IpcTest : public ::testing::Test {
- protected:
-  SocketPair pair_;
-  const int s_ = pair_.service.get(), peer_ = pair_.peer.get();
-  LogCapture log_;
-};
-
 // Bad arguments are refused with their log line and send nothing.
-TEST_F(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
-  const int s = s_;
+TEST(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
+  SocketPair pair;
+  LogCapture log;
+  const int s = pair.service.get();
   sds_command header{1, 1, 0}, zero{0, 5, 1};
   char buffer[4];
   const std::string overlong(4097, 'y'), bad_sock = "[ERROR] check sock:-1";
@@ -440,7 +420,8 @@ TEST_F(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
       {[&] { return sds_ipc_send_custom_type(s, nullptr, 4); }, -1, bad_buffer},
       {[&] { return sds_ipc_send_string(s, nullptr); }, -1, bad_buffer},
       {[&] { return sds_ipc_read_blob(s, nullptr, 4); }, -1, bad_buffer},
-      {[&] { return sds_ipc_read_blob(s, buffer, 0); }, -1, format("[ERROR] check size:0 sock:%d", s)},
+      {[&] { return sds_ipc_read_blob(s, buffer, 0); }, -1,
+       format("[ERROR] check size:0 sock:%d", s)},
       {[&] { return sds_ipc_send_string(s, ""); }, -1, format("[ERROR] check length:0 sock:%d", s)},
       {[&] { return sds_ipc_send_string(s, overlong.c_str()); }, -1,
        format("[ERROR] check length:4097 sock:%d", s)},
@@ -456,14 +437,14 @@ TEST_F(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
        format("[errno:%d] [%s]", ENOENT, strerror(ENOENT))},
   };
   for (const auto& c : cases) {
-    log_.clear();
+    log.clear();
     EXPECT_EQ(c.call(), c.result) << c.message;
-    EXPECT_TRUE(log_.contains(c.message)) << c.message;
+    EXPECT_TRUE(log.contains(c.message)) << c.message;
   }
-  EXPECT_FALSE(readable_now(peer_));
+  EXPECT_FALSE(readable_now(pair.peer.get()));
   ASSERT_EQ(fcntl(s, F_SETFL, O_NONBLOCK), 0);  // a read that would block is tried three times
   EXPECT_EQ(sds_ipc_recv(s, buffer, sizeof buffer, "probe"), -1);
-  EXPECT_EQ(log_.count(format("[IPC.Read] probe exception sock:%d", s)), 3);
+  EXPECT_EQ(log.count(format("[IPC.Read] probe exception sock:%d", s)), 3);
 }
 
 // Every item of a reply to a gone peer was tried and logged, and the handler
@@ -550,22 +531,21 @@ TEST(WorkerTest, WorkerEndingBeforeTheLoopRunsStillEndsTheLoop) {
   ASSERT_EQ(pthread_create(&worker, nullptr, sds_client_thread_idle, &slot), 0);
   ASSERT_EQ(pthread_join(worker, nullptr), 0);
   EXPECT_TRUE(log.contains(format("disconnect client:-1 sock:%d", slot.sock)));
-  bool guard_fired = false;  // the loop runs until the worker's quit ends it, or this guard
-  const auto fire = [](gpointer fired) -> gboolean {
-    *static_cast<bool*>(fired) = true;
+  bool fired = false;  // the loop runs until the worker's quit ends it, or this guard
+  const auto fire = [](gpointer f) -> gboolean {
+    *static_cast<bool*>(f) = true;
     g_main_loop_quit(sds_main_loop);
     return G_SOURCE_REMOVE;
   };
-  guint guard = g_timeout_add_seconds(10, fire, &guard_fired);
+  guint guard = g_timeout_add_seconds(10, fire, &fired);
   g_main_loop_run(sds_main_loop);
-  if (!guard_fired) g_source_remove(guard);
-  EXPECT_FALSE(guard_fired);
+  EXPECT_FALSE(fired);
+  if (!fired) g_source_remove(guard);
   g_main_loop_unref(sds_main_loop);
   sds_main_loop = nullptr;
 }
 
-// The client library against a scripted peer on a socket pair, its replies
-// queued before the call.
+// The client library against a scripted peer, its replies queued before the call.
 class ClientTest : public ::testing::Test {
  protected:
   void SetUp() override { open(); }
@@ -670,24 +650,24 @@ TEST_F(ClientTest, RepliesThatDoNotFitAreRefusedBeforeAnyAllocation) {
               c.status);
     EXPECT_TRUE(!icon.pixels && icon.byte_count == 0 && !ids.ids && !title);
     EXPECT_EQ(connection_.is_open(), c.cmd == SDS_CMD_GET_ICON);  // an icon reply was read whole
-    EXPECT_EQ(sent(), c.cmd == SDS_CMD_GET_FULL_IDS ? words({c.cmd, 77, 0, 6}) : words({c.cmd, 77, 3}));
+    EXPECT_EQ(sent(),
+              c.cmd == SDS_CMD_GET_FULL_IDS ? words({c.cmd, 77, 0, 6}) : words({c.cmd, 77, 3}));
   }
   int32_t seconds = 0;
   EXPECT_EQ(sds_client_get_next_update_duration(connection_, &seconds), SDS_ERROR_IO_ERROR);
 }
 
-// The path follows the service's root rule; the library tells why it failed
-// only to a log callback, and keeps the errno.
+// The path follows the root rule; why a call failed goes only to the log callback.
 TEST_F(ClientTest, SocketPathFollowsTheRootAndFailuresGoOnlyToTheLogCallback) {
   EXPECT_EQ(sds_client_socket_path(), root_.dir() + SDS_CLIENT_SOCKET_PATH);
-  EXPECT_EQ(sds_client_socket_path(), sds_path(SDS_SOCKET_PATH));
   std::vector<std::string> lines;
   const auto log = [](void* user, const char* line) {
     static_cast<std::vector<std::string>*>(user)->push_back(line);
   };
   sds_client_set_log(log, &lines);
   SdsConnection connection;
-  EXPECT_EQ(sds_client_connect(root_.dir() + "/absent.sock", connection), SDS_CLIENT_ERROR_NO_SOCKET);
+  EXPECT_EQ(sds_client_connect(root_.dir() + "/absent.sock", connection),
+            SDS_CLIENT_ERROR_NO_SOCKET);
   sds_client_set_log(nullptr, nullptr);
   EXPECT_EQ(connection.error_number(), ENOENT);
   EXPECT_EQ(lines, std::vector<std::string>{"connect " + root_.dir() +
