@@ -23,31 +23,25 @@ namespace {
 namespace fs = std::filesystem;
 
 
-class Packaging : public ::testing::Test {
- protected:
-  void SetUp() override {
-    ProcessResult result = install_staged(stage_, "/usr");
-    ASSERT_EQ(result.exit_code, 0) << result.out << result.err;
-  }
-  TempRoot root_;
-  const std::string stage_ = root_.dir() + "/stage", usr_ = stage_ + "/usr/";
-};
-
 // A program built out of this tree against the installed client library
 // (with pkg-config and with find_package) lists the deck of the installed
 // service and saves an icon as PNG. That service loads the module of its own
 // installation (bin/ and lib/ apart), and only for a pull.
-TEST_F(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
+TEST(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
+  TempRoot root;
+  const std::string usr = root.dir() + "/stage/usr/";
+  ProcessResult installed = install_staged(root.dir() + "/stage", "/usr");
+  ASSERT_EQ(installed.exit_code, 0) << installed.out << installed.err;
   const std::string example = SITEDECK_SOURCE_DIR "/client/examples";
-  const std::string lib = usr_ + SITEDECK_INSTALL_LIBDIR;
-  const std::string by_pkg_config = root_.dir() + "/deck-icons-pc";
-  const std::string by_cmake = root_.dir() + "/cmake-build";
+  const std::string lib = usr + SITEDECK_INSTALL_LIBDIR;
+  const std::string by_pkg_config = root.dir() + "/deck-icons-pc";
+  const std::string by_cmake = root.dir() + "/cmake-build";
   for (const auto& build : std::vector<std::vector<std::string>>{
            {"/bin/sh", "-c",
             SITEDECK_CXX_COMPILER " -std=c++17 " SITEDECK_EXAMPLE_FLAGS " -o " + by_pkg_config +
                 " " + example + "/deck-icons.cpp $(PKG_CONFIG_PATH=" + lib +
                 "/pkgconfig pkg-config --cflags --libs sitedeck-client libpng)"},
-           {SITEDECK_CMAKE_COMMAND, "-S", example, "-B", by_cmake, "-DCMAKE_PREFIX_PATH=" + usr_,
+           {SITEDECK_CMAKE_COMMAND, "-S", example, "-B", by_cmake, "-DCMAKE_PREFIX_PATH=" + usr,
             "-DCMAKE_CXX_COMPILER=" SITEDECK_CXX_COMPILER,
             "-DCMAKE_CXX_FLAGS=" SITEDECK_EXAMPLE_FLAGS},
            {SITEDECK_CMAKE_COMMAND, "--build", by_cmake}}) {
@@ -58,13 +52,13 @@ TEST_F(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
   news.icon_data = seed_pixels(4, 3, 7);
   news.icon_size = "4x3";
   ASSERT_TRUE(seed_deck({news, seed_item(3, "https://mail.example/", "Mail", 2)}));
-  const std::string installed = usr_ + SITEDECK_INSTALL_BINDIR "/browser-sitedeck-service";
+  const std::string service = usr + SITEDECK_INSTALL_BINDIR "/browser-sitedeck-service";
   ServiceHarness activated, direct;
-  activated.set_service_path(installed);
+  activated.set_service_path(service);
   ASSERT_TRUE(activated.start_activated(/*once=*/false));
   for (const std::string& program : {by_pkg_config, by_cmake + "/deck-icons"}) {
     SCOPED_TRACE(program);
-    const std::string out = root_.dir() + "/icons-" + fs::path(program).filename().string();
+    const std::string out = root.dir() + "/icons-" + fs::path(program).filename().string();
     fs::create_directories(out);
     ProcessResult result = run_process({"/usr/bin/env", "LD_LIBRARY_PATH=" + lib, program, out});
     EXPECT_EQ(result.exit_code, 0) << result.err;
@@ -85,7 +79,7 @@ TEST_F(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
     return read_file("/proc/" + std::to_string(direct.pid()) + "/maps").find(library) !=
            std::string::npos;
   };
-  direct.set_service_path(installed);
+  direct.set_service_path(service);
   ASSERT_TRUE(direct.start_direct());
   SdsConnection connection;
   ASSERT_EQ(direct.connect(&connection), SDS_ERROR_NONE) << direct.output();
@@ -97,7 +91,7 @@ TEST_F(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
   }
   // No server list: the pull runs and fails, which it can only do with the module.
   EXPECT_EQ(sds_client_initialize(connection, 37.5, 127.25, "1.0"), SDS_ERROR_DATA_PULL_FAILED);
-  const std::string module = usr_ + SITEDECK_INSTALL_MODULEDIR "/libsitedeck-pull.so";
+  const std::string module = usr + SITEDECK_INSTALL_MODULEDIR "/libsitedeck-pull.so";
   EXPECT_TRUE(mapped(fs::canonical(module).string() + "\n"));
   connection.close();  // and it ends as cleanly, without a leak under the sanitizers
   ASSERT_TRUE(direct.wait_exit(&status));
@@ -127,8 +121,7 @@ TEST(SocketActivate, ServiceUnderSystemdActivationServesOneConnectionAndEnds) {
   FILE* child = popen(command.c_str(), "r");
   ASSERT_NE(child, nullptr);
   std::string output;
-  char line[4096];
-  while (output.find("Listening on") == std::string::npos && std::fgets(line, sizeof line, child)) {
+  for (char line[4096]; output.find("Listening on") == output.npos && fgets(line, 4096, child);) {
     output += line;
   }
   SdsConnection connection;
@@ -138,15 +131,14 @@ TEST(SocketActivate, ServiceUnderSystemdActivationServesOneConnectionAndEnds) {
   EXPECT_EQ(std::vector<int32_t>(ids.ids.get(), ids.ids.get() + ids.count),
             (std::vector<int32_t>{3, 7}));
   EXPECT_EQ(sds_client_release_shm(connection), SDS_ERROR_NONE);  // which ends the connection
-  while (std::fgets(line, sizeof line, child)) output += line;
+  for (char line[4096]; fgets(line, 4096, child);) output += line;
   EXPECT_EQ(exit_code_of(pclose(child)), 0) << output;
   EXPECT_NE(output.find("listen systemd socket:3"), std::string::npos) << output;
 }
 
-// tools/soak made short, on 1001 sites: a thousand requests on one connection,
-// then twenty connections, with descriptors and mappings flat (AddressSanitizer
-// checks leaks at each exit); the preview shows the first thousand; SIGTERM
-// ends the activator and removes its socket.
+// tools/soak made short, on 1001 sites: 1000 requests on one connection, then 20
+// connections, descriptors and mappings flat (AddressSanitizer checks leaks at
+// exit); the preview shows the first 1000; SIGTERM ends the activator, unlinks.
 TEST(Soak, RequestsAndConnectionsLeaveDescriptorsAndMappingsFlatAndNothingBehind) {
   TempRoot root;
   std::vector<SeedItem> items;

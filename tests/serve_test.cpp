@@ -20,6 +20,7 @@
 #include <cstring>
 #include <fstream>
 #include <functional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -92,7 +93,6 @@ class DeckCommands : public ::testing::Test {
     one.icon_data = pixels_;
     SeedItem two = seed_item(2, "https://two.example/news", "Two", 1);
     two.dominant_color = "#405060";
-    two.favicon_exists = 1;
     SeedItem three = seed_item(3, "https://three.example/", "Three", 3);
     three.touch_icon_exists = 1;
     three.is_dirty = -1;
@@ -202,9 +202,7 @@ TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryAndReleaseRemovesTheObje
   expect_nothing_pending();
   EXPECT_EQ(shm_prefix(24), pixels_);  // still the previous icon
   sds_client_icon icon, again, none;
-  ASSERT_EQ(sds_client_get_icon(connection_, 1, &icon), SDS_ERROR_NONE);
-  EXPECT_EQ(std::make_pair(icon.width, icon.height), std::make_pair(3, 2));
-  EXPECT_EQ(std::vector<uint8_t>(icon.pixels.get(), icon.pixels.get() + icon.byte_count), pixels_);
+  ASSERT_EQ(sds_client_get_icon(connection_, 1, &icon), SDS_ERROR_NONE);  // its mapping kept
   {  // the old object, scribbled over and removed
     UniqueFd old(shm_open(SDS_SHM_NAME, O_RDWR, 0));
     void* mapping = mmap(nullptr, SDS_SHM_SIZE, PROT_WRITE, MAP_SHARED, old.get(), 0);
@@ -220,6 +218,7 @@ TEST_F(DeckCommands, IconPixelsArriveThroughSharedMemoryAndReleaseRemovesTheObje
   UniqueFd fresh(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT | O_EXCL, 0666));
   ASSERT_EQ(ftruncate(fresh.get(), static_cast<off_t>(SDS_SHM_SIZE)), 0);
   ASSERT_EQ(sds_client_get_icon(connection_, 1, &again), SDS_ERROR_NONE);
+  EXPECT_EQ(std::make_pair(again.width, again.height), std::make_pair(3, 2));
   EXPECT_EQ(std::vector<uint8_t>(again.pixels.get(), again.pixels.get() + 24), pixels_);
   EXPECT_EQ(sds_client_get_icon(connection_, 99, &none), SDS_ERROR_NO_DATA);
   EXPECT_FALSE(none.pixels);
@@ -393,6 +392,30 @@ TEST(Activation, WithoutActivationExitsWithOneAndSigtermBeforeAnyClientWith255) 
   EXPECT_TRUE(service.has_message("[CRITICAL] accept Sitedeck service was crashed ?"));
 }
 
+// What the module uses of the service must come from the binary: a copy in
+// the module keeps state of its own (a cache, a handle) that nothing shows.
+TEST(PullModule, ModuleCarriesNoCopyOfWhatTheBinaryExports) {
+  const auto defined = [](const char* file) {  // strong names for the dynamic linker
+    std::set<std::string> names;
+    FILE* nm = popen((std::string("nm -D --defined-only ") + file).c_str(), "r");
+    char type = 0, name[4096];
+    while (nm != nullptr && std::fscanf(nm, "%*s %c %4095s", &type, name) == 2) {
+      if (std::strchr("WVwvu", type) == nullptr && std::strchr(name, '@') == nullptr) {
+        names.insert(name);
+      }
+    }
+    EXPECT_TRUE(nm != nullptr && pclose(nm) == 0) << file;
+    return names;
+  };
+  const auto binary = defined(SITEDECK_BIN_DIR "/browser-sitedeck-service");
+  std::string both;
+  for (const auto& name : defined(SITEDECK_BIN_DIR "/libsitedeck-pull.so")) {
+    if (binary.count(name) != 0) both += " " + name;
+  }
+  EXPECT_GT(binary.size(), 50u);
+  EXPECT_EQ(both, "") << "defined in both: such a module file belongs to SERVE_SOURCES";
+}
+
 // Bad arguments are refused with their log line and send nothing.
 TEST(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
   SocketPair pair;
@@ -401,7 +424,7 @@ TEST(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
   sds_command header{1, 1, 0}, zero{0, 5, 1};
   char buffer[4];
   const std::string overlong(4097, 'y'), bad_sock = "[ERROR] check sock:-1";
-  const std::string bad_buffer = format("[ERROR] check buffer sock:%d", s);
+  const auto at = [s](const char* check) { return format("[ERROR] check %s sock:%d", check, s); };
   struct Case {
     std::function<long()> call;
     long result;
@@ -417,16 +440,13 @@ TEST(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
       {[&] { return sds_ipc_recv(-1, buffer, 4, "probe"); }, -1, "[ERROR] probe check sock:-1"},
       {[&] { return sds_ipc_recv(s, nullptr, 4, "probe"); }, -1,
        format("[ERROR] probe check buffer sock:%d", s)},
-      {[&] { return sds_ipc_send_custom_type(s, nullptr, 4); }, -1, bad_buffer},
-      {[&] { return sds_ipc_send_string(s, nullptr); }, -1, bad_buffer},
-      {[&] { return sds_ipc_read_blob(s, nullptr, 4); }, -1, bad_buffer},
-      {[&] { return sds_ipc_read_blob(s, buffer, 0); }, -1,
-       format("[ERROR] check size:0 sock:%d", s)},
-      {[&] { return sds_ipc_send_string(s, ""); }, -1, format("[ERROR] check length:0 sock:%d", s)},
-      {[&] { return sds_ipc_send_string(s, overlong.c_str()); }, -1,
-       format("[ERROR] check length:4097 sock:%d", s)},
-      {[&] { return sds_ipc_simple_response(s, &zero); }, 5,
-       format("[ERROR] check command(0) sock:%d", s)},
+      {[&] { return sds_ipc_send_custom_type(s, nullptr, 4); }, -1, at("buffer")},
+      {[&] { return sds_ipc_send_string(s, nullptr); }, -1, at("buffer")},
+      {[&] { return sds_ipc_read_blob(s, nullptr, 4); }, -1, at("buffer")},
+      {[&] { return sds_ipc_read_blob(s, buffer, 0); }, -1, at("size:0")},
+      {[&] { return sds_ipc_send_string(s, ""); }, -1, at("length:0")},
+      {[&] { return sds_ipc_send_string(s, overlong.c_str()); }, -1, at("length:4097")},
+      {[&] { return sds_ipc_simple_response(s, &zero); }, 5, at("command(0)")},
       {[] { return errno = EPIPE, sds_ipc_check_stderr(1); }, SDS_ERROR_IO_ERROR,
        format("[EPIPE:%d] Broken Pipe [%s]", EPIPE, strerror(EPIPE))},
       {[] { return errno = EAGAIN, sds_ipc_check_stderr(1); }, SDS_ERROR_IO_EAGAIN,
@@ -661,10 +681,9 @@ TEST_F(ClientTest, RepliesThatDoNotFitAreRefusedBeforeAnyAllocation) {
 TEST_F(ClientTest, SocketPathFollowsTheRootAndFailuresGoOnlyToTheLogCallback) {
   EXPECT_EQ(sds_client_socket_path(), root_.dir() + SDS_CLIENT_SOCKET_PATH);
   std::vector<std::string> lines;
-  const auto log = [](void* user, const char* line) {
-    static_cast<std::vector<std::string>*>(user)->push_back(line);
-  };
-  sds_client_set_log(log, &lines);
+  sds_client_set_log(
+      [](void* user, const char* line) { static_cast<decltype(lines)*>(user)->push_back(line); },
+      &lines);
   SdsConnection connection;
   EXPECT_EQ(sds_client_connect(root_.dir() + "/absent.sock", connection),
             SDS_CLIENT_ERROR_NO_SOCKET);
