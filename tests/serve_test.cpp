@@ -465,6 +465,9 @@ TEST(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
   ASSERT_EQ(fcntl(s, F_SETFL, O_NONBLOCK), 0);  // a read that would block is tried three times
   EXPECT_EQ(sds_ipc_recv(s, buffer, sizeof buffer, "probe"), -1);
   EXPECT_EQ(log.count(format("[IPC.Read] probe exception sock:%d", s)), 3);
+  pair.peer.reset();  // a string read at the end of the stream
+  EXPECT_EQ(sds_ipc_read_string(s), nullptr);
+  EXPECT_TRUE(log.contains(format("[ERROR] read length:0 sock:%d", s)));
 }
 
 // Every item of a reply to a gone peer was tried and logged, and the handler
@@ -544,7 +547,6 @@ TEST(WorkerTest, WorkerEndingBeforeTheLoopRunsStillEndsTheLoop) {
   sds_main_loop = g_main_loop_new(nullptr, FALSE);
   SocketPair pair;
   sds_client slot;
-  slot.client_id = 7;
   slot.sock = pair.service.get();
   pair.peer.reset();
   pthread_t worker{};

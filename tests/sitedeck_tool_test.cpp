@@ -185,11 +185,9 @@ TEST_F(SitedeckTool, EveryCommandPrintsExactlyWhatTheServiceHolds) {
                          std::to_string(written.size()) + "}"));
   EXPECT_EQ(std::regex_replace(sitedeck({"hello"}).out, std::regex("\\d+"), "1"), "client id: 1\n");
   // On a terminal 60 columns wide: bold header, colour swatches, cells cut to fit.
-  const std::string out = run_process({"/usr/bin/script", "-qec",
-                                       "stty cols 60 && env -u NO_COLOR TERM=xterm-256color " +
-                                           kTool + " --socket " + service_.socket_path() + " list",
-                                       "/dev/null"})
-                              .out;
+  const std::string command = "stty cols 60 && env -u NO_COLOR TERM=xterm-256color " + kTool +
+                              " --color=auto --socket " + service_.socket_path() + " list";
+  const std::string out = run_process({"/usr/bin/script", "-qec", command, "/dev/null"}).out;
   EXPECT_NE(out.find("\033[1mID\033[0m"), std::string::npos) << out;
   EXPECT_NE(out.find("\033[48;2;170;0;0m  \033[0m #AA0000"), std::string::npos) << out;
   EXPECT_NE(out.find("\r\n5   A very lo\xE2\x80\xA6  https://fi\xE2\x80\xA6  "), std::string::npos);
