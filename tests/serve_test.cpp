@@ -269,7 +269,9 @@ TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
     ~Restore() { EXPECT_TRUE(before.empty() || write_sysctl(kSwitch, before)); }
   } restore;
   if (geteuid() != 0 || nobody == nullptr || !(std::ifstream(kSwitch) >> restore.before) ||
-      !write_sysctl(kSwitch, restore.before)) restore.before.clear();
+      !write_sysctl(kSwitch, restore.before)) {
+    restore.before.clear();
+  }
   struct Case {
     const char* name;
     std::function<int()> make;  // 0 when it stands at the name
