@@ -1,216 +1,70 @@
-// The installation as a package would make it: the files `cmake --install`
-// puts below a staging directory, the units and the tmpfiles.d entry filled
-// in for the prefix, the installed service finding its installed pull
-// module, a program built out of this tree against the installed client
-// library, and systemd's own tools (systemd-tmpfiles, systemd-analyze)
-// accepting what was installed.
+// A staged installation used as a package is; systemd's socket activation;
+// and the short soak run of tools/soak.
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <map>
 #include <string>
 
+#include "pull/sitedeck-service-utils.h"
 #include "sitedeck-client-commands.h"
-#include "sitedeck-client.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "pull/sitedeck-service-utils.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
 #include "support/staged_install.h"
 #include "support/temp_root.h"
+#include "tools/soak/proc_stats.h"
 
 namespace {
 
 namespace fs = std::filesystem;
 
-const std::string kBin = SITEDECK_INSTALL_BINDIR;
-const std::string kModuleDir = SITEDECK_INSTALL_MODULEDIR;
-const std::string kLibDir = SITEDECK_INSTALL_LIBDIR;
-const std::string kShareDir = std::string(SITEDECK_INSTALL_DATADIR) + "/browser-sitedeck-service";
-const std::string kUnitDir = "lib/systemd/system";
 
-// Every file below `dir`, relative to it, with whether it may be executed.
-std::map<std::string, bool> files_below(const std::string& dir) {
-  std::map<std::string, bool> files;
-  for (const auto& entry : fs::recursive_directory_iterator(dir)) {
-    if (entry.is_directory()) continue;
-    bool executable = (entry.status().permissions() & fs::perms::owner_exec) != fs::perms::none;
-    files[entry.path().lexically_relative(dir).string()] = executable;
-  }
-  return files;
-}
-
-mode_t mode_of(const std::string& path) {
-  struct stat info {};
-  return stat(path.c_str(), &info) == 0 ? (info.st_mode & 07777) : 0;
-}
-
-// Installs for `prefix` below `stage`; a failed installation fails the case.
-void install_or_fail(const std::string& stage, const std::string& prefix) {
-  ProcessResult result = install_staged(stage, prefix);
-  ASSERT_TRUE(result.finished);
-  ASSERT_EQ(result.exit_code, 0) << result.out << result.err;
-}
-
-// Skips the case when `tool` is missing, or fails it when the environment
-// requires the systemd tools; returns the tool's path otherwise.
-#define REQUIRE_TOOL(variable, tool)                                              \
-  std::string variable = find_program(tool);                                      \
-  if (variable.empty()) {                                                         \
-    if (systemd_tools_required()) FAIL() << tool " is missing (package systemd)"; \
-    GTEST_SKIP() << tool " is not installed (package systemd); skipped";          \
-  }
-
-// Every case starts from an installation for /usr below `stage_`.
-class Packaging : public ::testing::Test {
- protected:
-  void SetUp() override { install_or_fail(stage_, "/usr"); }
-  TempRoot root_;
-  const std::string stage_ = root_.dir() + "/stage";
-};
-
-// For each prefix chosen when installing: exactly the expected files with
-// their executable bits, and units and a tmpfiles.d entry that name the
-// installed files for that prefix, not the one of the build.
-TEST_F(Packaging, InstallPutsEveryFileInPlaceAndNamesItForEachPrefix) {
-  for (const std::string prefix : {"/usr", "/opt/sitedeck"}) {
-    SCOPED_TRACE(prefix);
-    const std::string stage = prefix == "/usr" ? stage_ : root_.dir() + "/other-stage";
-    if (stage != stage_) install_or_fail(stage, prefix);
-    const std::string base = stage + prefix;
-    // Below the stage, and whether it must be executable. Test, benchmark,
-    // fuzzing and stand-in programs stay in the build tree.
-    const std::string p = prefix.substr(1) + "/";
-    std::map<std::string, bool> expected = {
-        {p + kBin + "/browser-sitedeck-service", true},
-        {p + kBin + "/sitedeck", true},
-        {p + kBin + "/sitedeck-activator", true},
-        {p + kModuleDir + "/libsitedeck-pull.so", false},
-        {p + kLibDir + "/libsitedeck-client.so", false},
-        {p + kLibDir + "/libsitedeck-client.so.1", false},
-        {p + kLibDir + "/libsitedeck-client.so." + SITEDECK_PROJECT_VERSION, false},
-        {p + kLibDir + "/pkgconfig/sitedeck-client.pc", false},
-        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientConfig.cmake", false},
-        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientConfigVersion.cmake", false},
-        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientTargets.cmake", false},
-        {p + kLibDir + "/cmake/SitedeckClient/SitedeckClientTargets-" + SITEDECK_BUILD_TYPE_LOWER + ".cmake",
-         false},
-        {p + kShareDir + "/site_deck_server_data.xml", false},
-        {p + kUnitDir + "/browser-sitedeck-service.socket", false},
-        {p + kUnitDir + "/browser-sitedeck-service.service", false},
-        {p + "lib/tmpfiles.d/browser-sitedeck-service.conf", false},
-    };
-    for (const char* header : {"sitedeck-client.h", "sitedeck-client-commands.h",
-                               "sitedeck-client-deck.h", "sitedeck-client-status.h"}) {
-      expected[p + "include/" + header] = false;
-    }
-    // The sample default deck: its item list and every icon it names.
-    for (const char* name : {"site_deck_default.json", "news-96.png", "mail-96.png", "maps-96.png",
-                             "weather-96.png", "video-96.png", "shop-96.png", "wiki-96.png"}) {
-      expected[p + kShareDir + "/default-deck/" + name] = false;
-    }
-    std::map<std::string, bool> installed = files_below(stage);
-    // Libraries are loaded, never executed: whether they carry the
-    // executable bit is the platform's custom.
-    for (auto& [path, executable] : installed) {
-      if (path.find(".so") != std::string::npos) executable = false;
-    }
-    EXPECT_EQ(installed, expected);
-    // The sample server list is the one in the source tree, byte for byte.
-    const std::string server_list = prefix + "/" + kShareDir + "/site_deck_server_data.xml";
-    EXPECT_EQ(read_file(stage + server_list),
-              read_file(std::string(SITEDECK_SOURCE_DIR) + "/packaging/site_deck_server_data.xml"));
-
-    std::string service = read_file(base + "/" + kUnitDir + "/browser-sitedeck-service.service");
-    EXPECT_EQ(unit_setting(service, "ExecStart"),
-              prefix + "/" + kBin + "/browser-sitedeck-service");
-    EXPECT_EQ(unit_setting(service, "ReadWritePaths"), SDS_DATA_DIR);
-    std::string socket = read_file(base + "/" + kUnitDir + "/browser-sitedeck-service.socket");
-    EXPECT_EQ(unit_setting(socket, "ListenStream"), SDS_SOCKET_PATH);
-    EXPECT_EQ(unit_setting(socket, "Accept"), "no");
-    std::string tmpfiles = read_file(base + "/lib/tmpfiles.d/browser-sitedeck-service.conf");
-    EXPECT_NE(
-        tmpfiles.find(std::string("C ") + SDS_SERVER_DATA_XML + " - - - - " + server_list + "\n"),
-        std::string::npos)
-        << tmpfiles;
-    EXPECT_EQ((service + tmpfiles).find("@SITEDECK_"), std::string::npos)
-        << "a placeholder was left";
-  }
-}
-
-// The installed binary lives apart from its module (bin/ and lib/): it must
-// still load the module, and the one of its own installation.
-TEST_F(Packaging, InstalledServiceLoadsItsInstalledPullModule) {
-  ServiceHarness service;
-  service.set_service_path(stage_ + "/usr/" + kBin + "/browser-sitedeck-service");
-  ASSERT_TRUE(service.start_direct());
-  SdsConnection connection;
-  ASSERT_EQ(service.connect(&connection), SDS_ERROR_NONE) << service.output();
-
-  // No server list in the root: the pull runs and fails, which it can only
-  // do once the module is loaded.
-  EXPECT_EQ(sds_client_initialize(connection, 37.5, 127.25, "1.0"), SDS_ERROR_DATA_PULL_FAILED);
-  std::ifstream maps("/proc/" + std::to_string(service.pid()) + "/maps");
-  std::string line, mapped_module;
-  while (std::getline(maps, line)) {
-    size_t at = line.find("/libsitedeck-pull.so");
-    if (at != std::string::npos) mapped_module = line.substr(line.find('/'));
-  }
-  std::string installed_module = stage_ + "/usr/" + kModuleDir + "/libsitedeck-pull.so";
-  EXPECT_EQ(fs::path(mapped_module), fs::canonical(installed_module));
-  EXPECT_FALSE(service.has_message_matching(R"(\[CRITICAL\] cannot load .*)")) << service.output();
-  connection.close();
-  int status = 0;
-  ASSERT_TRUE(service.wait_exit(&status));
-  EXPECT_EQ(exit_code_of(status), 0) << service.output();
-}
-
-// What a browser developer does: a program of their own, built out of this
-// tree against the installed client library (once with pkg-config, once with
-// find_package), lists the deck of the real service and saves an icon as
-// PNG, which decodes to the stored pixels.
-TEST_F(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
-  const std::string prefix = stage_ + "/usr";
-  const std::string example = std::string(SITEDECK_SOURCE_DIR) + "/client/examples";
-  const std::string flags = SITEDECK_EXAMPLE_FLAGS;
-  const std::string pkg_config = "PKG_CONFIG_PATH=" + prefix + "/" + kLibDir + "/pkgconfig ";
-  const std::string by_pkg_config = root_.dir() + "/deck-icons-pc";
-  const std::string by_cmake = root_.dir() + "/cmake-build";
-  std::vector<std::vector<std::string>> builds = {
-      {"/bin/sh", "-c",
-       std::string(SITEDECK_CXX_COMPILER) + " -std=c++17 " + flags + " -o " + by_pkg_config + " " +
-           example + "/deck-icons.cpp $(" + pkg_config +
-           "pkg-config --cflags --libs sitedeck-client libpng)"},
-      {SITEDECK_CMAKE_COMMAND, "-S", example, "-B", by_cmake, "-DCMAKE_PREFIX_PATH=" + prefix,
-       std::string("-DCMAKE_CXX_COMPILER=") + SITEDECK_CXX_COMPILER, "-DCMAKE_CXX_FLAGS=" + flags},
-      {SITEDECK_CMAKE_COMMAND, "--build", by_cmake},
-  };
-  for (const auto& build : builds) {
+// A program built out of this tree against the installed client library
+// (with pkg-config and with find_package) lists the deck of the installed
+// service and saves an icon as PNG. That service loads the module of its own
+// installation (bin/ and lib/ apart), and only for a pull.
+TEST(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
+  TempRoot root;
+  const std::string usr = root.dir() + "/stage/usr/";
+  ProcessResult installed = install_staged(root.dir() + "/stage", "/usr");
+  ASSERT_EQ(installed.exit_code, 0) << installed.out << installed.err;
+  const std::string example = SITEDECK_SOURCE_DIR "/client/examples";
+  const std::string lib = usr + SITEDECK_INSTALL_LIBDIR;
+  const std::string by_pkg_config = root.dir() + "/deck-icons-pc";
+  const std::string by_cmake = root.dir() + "/cmake-build";
+  for (const auto& build : std::vector<std::vector<std::string>>{
+           {"/bin/sh", "-c",
+            SITEDECK_CXX_COMPILER " -std=c++17 " SITEDECK_EXAMPLE_FLAGS " -o " + by_pkg_config +
+                " " + example + "/deck-icons.cpp $(PKG_CONFIG_PATH=" + lib +
+                "/pkgconfig pkg-config --cflags --libs sitedeck-client libpng)"},
+           {SITEDECK_CMAKE_COMMAND, "-S", example, "-B", by_cmake, "-DCMAKE_PREFIX_PATH=" + usr,
+            "-DCMAKE_CXX_COMPILER=" SITEDECK_CXX_COMPILER,
+            "-DCMAKE_CXX_FLAGS=" SITEDECK_EXAMPLE_FLAGS},
+           {SITEDECK_CMAKE_COMMAND, "--build", by_cmake}}) {
     ProcessResult result = run_process(build, 120000);
-    ASSERT_TRUE(result.finished);
     ASSERT_EQ(result.exit_code, 0) << build.back() << "\n" << result.out << result.err;
   }
-
   SeedItem news = seed_item(7, "https://news.example/", "News", 1);
   news.icon_data = seed_pixels(4, 3, 7);
   news.icon_size = "4x3";
   ASSERT_TRUE(seed_deck({news, seed_item(3, "https://mail.example/", "Mail", 2)}));
-  ServiceHarness service;
-  ASSERT_TRUE(service.start_activated(/*once=*/false));
+  const std::string service = usr + SITEDECK_INSTALL_BINDIR "/browser-sitedeck-service";
+  ServiceHarness activated, direct;
+  activated.set_service_path(service);
+  ASSERT_TRUE(activated.start_activated(/*once=*/false));
   for (const std::string& program : {by_pkg_config, by_cmake + "/deck-icons"}) {
     SCOPED_TRACE(program);
-    const std::string out_dir = root_.dir() + "/icons-" + fs::path(program).filename().string();
-    fs::create_directories(out_dir);
-    ProcessResult result = run_process(
-        {"/usr/bin/env", "LD_LIBRARY_PATH=" + prefix + "/" + kLibDir, program, out_dir});
-    ASSERT_TRUE(result.finished);
+    const std::string out = root.dir() + "/icons-" + fs::path(program).filename().string();
+    fs::create_directories(out);
+    ProcessResult result = run_process({"/usr/bin/env", "LD_LIBRARY_PATH=" + lib, program, out});
     EXPECT_EQ(result.exit_code, 0) << result.err;
     EXPECT_EQ(result.out, "7\tNews\thttps://news.example/\n3\tMail\thttps://mail.example/\n");
-    EXPECT_EQ(files_below(out_dir), (std::map<std::string, bool>{{"7.png", false}}));
-    const std::string png = read_file(out_dir + "/7.png");
+    EXPECT_EQ(std::distance(fs::directory_iterator(out), {}), 1);
+    const std::string png = read_file(out + "/7.png");
     unsigned char* raw = nullptr;
     int width = 0, height = 0, size = 0;
     ASSERT_EQ(convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()),
@@ -219,83 +73,130 @@ TEST_F(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
     UniqueMalloc<unsigned char> pixels(raw);
     EXPECT_EQ(std::vector<uint8_t>(raw, raw + size), seed_pixels(4, 3, 7));
   }
-}
-
-TEST_F(Packaging, TmpfilesCreatesTheDataDirectoriesAndCopiesTheServerListOnce) {
-  REQUIRE_TOOL(tmpfiles, "systemd-tmpfiles");
-  // The entry is read from the stage_; its paths, the copy's source included,
-  // are taken below --root.
-  const std::vector<std::string> create = {
-      tmpfiles, "--create", "--root=" + stage_,
-      stage_ + "/usr/lib/tmpfiles.d/browser-sitedeck-service.conf"};
-  ProcessResult result = run_process(create);
-  ASSERT_TRUE(result.finished);
-  ASSERT_EQ(result.exit_code, 0) << result.err;
-
-  const struct {
-    const char* path;
-    mode_t mode;
-  } dirs[] = {
-      {SDS_DATA_DIR, 0755},
-      {SDS_SERVER_DIR, 0750},
-      {SDS_DATABASE_DIR, 0700},
-      {SDS_IMAGES_DIR, 0700},
+  int status = 0;
+  ASSERT_TRUE(activated.signal(SIGTERM) && activated.wait_exit(&status));
+  const auto mapped = [&](const std::string& library) {
+    return read_file("/proc/" + std::to_string(direct.pid()) + "/maps").find(library) !=
+           std::string::npos;
   };
-  for (const auto& d : dirs) {
-    SCOPED_TRACE(d.path);
-    EXPECT_TRUE(fs::is_directory(stage_ + d.path));
-    EXPECT_EQ(mode_of(stage_ + d.path), d.mode);
+  direct.set_service_path(service);
+  ASSERT_TRUE(direct.start_direct());
+  SdsConnection connection;
+  ASSERT_EQ(direct.connect(&connection), SDS_ERROR_NONE) << direct.output();
+  int32_t seconds = 0;
+  ASSERT_EQ(sds_client_get_next_update_duration(connection, &seconds), SDS_ERROR_NONE);
+  for (const char* library :
+       {"/libcurl", "/libxml2", "/libjson-glib", "/libpng", "/libsitedeck-pull"}) {
+    EXPECT_FALSE(mapped(library)) << library;
   }
-  std::string server_list = stage_ + SDS_SERVER_DATA_XML;
-  std::string sample = read_file(stage_ + "/usr/" + kShareDir + "/site_deck_server_data.xml");
-  EXPECT_EQ(read_file(server_list), sample);
-  // The default deck arrives whole, ready for a first start.
-  EXPECT_EQ(read_file(stage_ + SDS_DEFAULT_DECK_JSON_PATH),
-            read_file(stage_ + "/usr/" + kShareDir + "/default-deck/site_deck_default.json"));
-  EXPECT_TRUE(file_exists(stage_ + SDS_DEFAULT_DECK_DIR + std::string("/wiki-96.png")));
-
-  // The service rewrites the list when a server moves for good: running the
-  // entry again (every boot does) must keep that.
-  const std::string moved = "<values><Server><Id>1</Id></Server></values>\n";
-  ASSERT_TRUE(write_file(server_list, moved));
-  result = run_process(create);
-  ASSERT_TRUE(result.finished);
-  ASSERT_EQ(result.exit_code, 0) << result.err;
-  EXPECT_EQ(read_file(server_list), moved);
+  // No server list: the pull runs and fails, which it can only do with the module.
+  EXPECT_EQ(sds_client_initialize(connection, 37.5, 127.25, "1.0"), SDS_ERROR_DATA_PULL_FAILED);
+  const std::string module = usr + SITEDECK_INSTALL_MODULEDIR "/libsitedeck-pull.so";
+  EXPECT_TRUE(mapped(fs::canonical(module).string() + "\n"));
+  connection.close();  // and it ends as cleanly, without a leak under the sanitizers
+  ASSERT_TRUE(direct.wait_exit(&status));
+  EXPECT_EQ(exit_code_of(status), 0) << direct.output();
 }
 
-TEST_F(Packaging, SystemdAcceptsTheInstalledUnitsAndTheirSandbox) {
-  REQUIRE_TOOL(analyze, "systemd-analyze");
-  std::string system_units;
-  for (const char* dir : {"/usr/lib/systemd/system", "/lib/systemd/system"}) {
-    if (system_units.empty() && file_exists(std::string(dir) + "/sockets.target"))
-      system_units = dir;
+// systemd-socket-activate execs the service on the first connection with the
+// socket as descriptor 3 (as the unit with Accept=no); it ends with it.
+TEST(SocketActivate, ServiceUnderSystemdActivationServesOneConnectionAndEnds) {
+  const std::string activate = find_program("systemd-socket-activate");
+  if (activate.empty()) {
+    if (systemd_tools_required()) FAIL() << "systemd-socket-activate (package systemd) is missing";
+    GTEST_SKIP() << "systemd-socket-activate (package systemd) is not installed";
   }
-  if (system_units.empty()) {
-    if (systemd_tools_required()) FAIL() << "systemd's own units are missing";
-    GTEST_SKIP() << "systemd's own units (sockets.target) are not installed; skipped";
+  TempRoot root;
+  ASSERT_TRUE(seed_deck({seed_item(7, "https://seven.example/", "Seven", 1),
+                         seed_item(3, "https://three.example/", "Three", 0)}));
+  const std::string socket_path = root.path(SDS_SOCKET_PATH);
+  fs::create_directories(fs::path(socket_path).parent_path());  // the socket unit's part
+  // A fresh environment: the root, and the sanitizers' settings, passed on.
+  std::string command =
+      "timeout 60 " + activate + " -l " + socket_path + " -E SITEDECK_ROOT=" + root.dir();
+  for (const char* name : {"ASAN_OPTIONS", "UBSAN_OPTIONS", "LSAN_OPTIONS"}) {
+    if (std::getenv(name) != nullptr) command += std::string(" -E ") + name + "=" + getenv(name);
   }
-  // Verifying below --root checks ExecStart in the stage_; the units' default
-  // dependencies (sysinit.target, sockets.target) must be found there too,
-  // so systemd's own units are copied beside them.
-  fs::create_directories(stage_ + "/lib/systemd");
-  fs::copy(system_units, stage_ + "/lib/systemd/system",
-           fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+  command += " " SITEDECK_BIN_DIR "/browser-sitedeck-service 2>&1";
+  FILE* child = popen(command.c_str(), "r");
+  ASSERT_NE(child, nullptr);
+  std::string output;
+  for (char line[4096]; output.find("Listening on") == output.npos && fgets(line, 4096, child);) {
+    output += line;
+  }
+  SdsConnection connection;
+  EXPECT_EQ(sds_client_connect(socket_path, connection, {20000, 20000}), SDS_ERROR_NONE) << output;
+  sds_client_ids ids;
+  EXPECT_EQ(sds_client_get_full_ids(connection, &ids), SDS_ERROR_NONE);
+  EXPECT_EQ(std::vector<int32_t>(ids.ids.get(), ids.ids.get() + ids.count),
+            (std::vector<int32_t>{3, 7}));
+  EXPECT_EQ(sds_client_release_shm(connection), SDS_ERROR_NONE);  // which ends the connection
+  for (char line[4096]; fgets(line, 4096, child);) output += line;
+  EXPECT_EQ(exit_code_of(pclose(child)), 0) << output;
+  EXPECT_NE(output.find("listen systemd socket:3"), std::string::npos) << output;
+}
 
-  ProcessResult verify =
-      run_process({analyze, "verify", "--root=" + stage_, "browser-sitedeck-service.socket",
-                   "browser-sitedeck-service.service"});
-  ASSERT_TRUE(verify.finished);
-  EXPECT_EQ(verify.exit_code, 0) << verify.err;
-  // Unknown or misspelt settings are only warned about.
-  EXPECT_EQ(verify.err, "");
-
-  // systemd's own rating of the sandbox, 0 (tight) to 10 (open): the service
-  // needs the network, /dev/shm and root's chown, which alone cost about 2.5.
-  ProcessResult security = run_process({analyze, "security", "--offline=yes", "--threshold=30",
-                                        "--root=" + stage_, "browser-sitedeck-service.service"});
-  ASSERT_TRUE(security.finished);
-  EXPECT_EQ(security.exit_code, 0) << security.out << security.err;
+// tools/soak made short, on 1001 sites: 1000 requests on one connection, then 20
+// connections, descriptors and mappings flat (AddressSanitizer checks leaks at
+// exit); the preview shows the first 1000; SIGTERM ends the activator, unlinks.
+TEST(Soak, RequestsAndConnectionsLeaveDescriptorsAndMappingsFlatAndNothingBehind) {
+  TempRoot root;
+  std::vector<SeedItem> items;
+  for (int i = 1; i <= 1001; ++i) {
+    items.push_back(seed_item(i, "http://site-" + std::to_string(i) + ".example/", "Site", i));
+    if (i > 12) continue;
+    items.back().icon_size = "57x57";
+    items.back().icon_data = seed_pixels(57, 57, i);
+  }
+  ASSERT_TRUE(seed_deck(items));
+  ServiceHarness activator;
+  ASSERT_TRUE(activator.start_activated(/*once=*/false));
+  long failures = 0;
+  ProcStats settled, activator_first, service_first;
+  for (int round = 0; round <= 20; ++round) {
+    SdsConnection c;
+    ASSERT_EQ(activator.connect(&c), SDS_ERROR_NONE) << activator.output();
+    const std::vector<pid_t> services = proc_children(activator.pid());
+    ASSERT_EQ(services.size(), 1u);
+    for (int n = 0; n < (round == 0 ? 1000 : 4); ++n) {  // commands 3, 7, 10 and 11 in turn
+      const auto id = static_cast<int32_t>(1 + (n / 4) % 12);
+      SdsClientText url;
+      int32_t seconds = 0;
+      sds_client_icon icon;
+      sds_client_ids ids;
+      const bool right =
+          n % 4 == 0   ? sds_client_get_url(c, id, &url) == 0
+          : n % 4 == 1 ? sds_client_get_icon(c, id, &icon) == 0 && icon.width == 57
+          : n % 4 == 2 ? sds_client_get_next_update_duration(c, &seconds) == 0
+                       : sds_client_get_ids_by_dirty(c, 1, &ids) == 0 && ids.count == 1001;
+      failures += right ? 0 : 1;
+      // The first requests settle the database pages and the libraries' caches.
+      if (round == 0 && n == 199) settled = proc_stats(services[0]);
+    }
+    const ProcStats now = proc_stats(services[0]);
+    if (round == 0) activator_first = proc_stats(activator.pid());
+    if (round == 1) service_first = now;
+    const ProcStats& before = round == 0 ? settled : service_first;
+    EXPECT_EQ(now.fds, before.fds) << round;
+    EXPECT_LE(std::abs(now.mappings - before.mappings), round == 0 ? 0 : 16) << round;
+    EXPECT_EQ(sds_client_release_shm(c), SDS_ERROR_NONE);
+  }
+  EXPECT_EQ(failures, 0);
+  ProcessResult render = run_process({SITEDECK_BIN_DIR "/sitedeck", "--socket",
+                                      activator.socket_path(), "render", root.dir() + "/big"});
+  EXPECT_EQ(render.err,
+            "sitedeck: render: the deck has 1001 live sites; the page shows the first 1000\n");
+  const std::string page = read_file(root.dir() + "/big/index.html");
+  EXPECT_NE(page.find("data-id=\"1000\""), page.npos);
+  EXPECT_EQ(page.find("data-id=\"1001\""), page.npos);
+  const ProcStats last = proc_stats(activator.pid());
+  EXPECT_EQ(last.fds, activator_first.fds);
+  EXPECT_EQ(last.mappings, activator_first.mappings);
+  ASSERT_TRUE(activator.signal(SIGTERM));
+  int status = 0;
+  ASSERT_TRUE(activator.wait_exit(&status));
+  EXPECT_EQ(exit_code_of(status), 0);
+  EXPECT_FALSE(file_exists(activator.socket_path()));
 }
 
 }  // namespace
