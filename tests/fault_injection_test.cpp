@@ -91,7 +91,9 @@ TEST_F(FaultInjection, PullKilledAtAnyMomentLeavesOneWholeListAndTheNextPullRepa
     restore();
     const auto kill_after = std::chrono::duration_cast<std::chrono::microseconds>(
         whole_pull * ((round + jitter(random)) / 8.0));
-    ASSERT_TRUE(open());
+    // Activated directly (env execs the service), so that the signal reaches
+    // the service itself, not an activator in front of it.
+    ASSERT_TRUE(open({"/usr/bin/env"}));
     ASSERT_TRUE(send_initialize(connection.fd(), connection.cid(), kNoPosition, 0,
                                 SDS_ERROR_NO_DATA, nullptr));
     // This pause is the fault's moment, not a wait for an event.
@@ -99,6 +101,7 @@ TEST_F(FaultInjection, PullKilledAtAnyMomentLeavesOneWholeListAndTheNextPullRepa
     ASSERT_TRUE(service->signal(SIGKILL));
     int wait_status = 0;
     ASSERT_TRUE(service->wait_exit(&wait_status));
+    EXPECT_TRUE(WIFSIGNALED(wait_status));
     connection.close();
     const std::vector<std::string> after_kill = live();
     EXPECT_TRUE(after_kill == old_list || after_kill == new_list) << kill_after.count() << " us";
