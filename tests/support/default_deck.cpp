@@ -5,6 +5,8 @@
 #include "sitedeck-service-paths.h"
 #include "support/temp_root.h"
 
+namespace {
+
 std::string deck_icon_url(const std::string& file) {
   return "https://static.example.org/deck/" + file;
 }
@@ -31,6 +33,8 @@ std::string deck_json(const std::vector<DeckSite>& sites) {
   return "{\"itemCount\": " + std::to_string(sites.size()) + ", \"global\": {\"items\": [\n" +
          items + "\n]}}\n";
 }
+
+}  // namespace
 
 bool write_deck_list(const std::string& json) {
   const std::string dir = sds_path(SDS_DEFAULT_DECK_DIR);

@@ -18,15 +18,12 @@ struct DeckSite {
   bool specially_removed = false;
 };
 
-// The icon URL the deck lists for a file name.
-std::string deck_icon_url(const std::string& file);
-// The item list for `sites`: the chosen (administered) icon of each, plus a
-// larger non-administered one whose file is never written, so that a wrong
-// icon choice shows as a missing icon.
-std::string deck_json(const std::vector<DeckSite>& sites);
 // Creates the default-deck directory with `json` as its list (nothing else).
 bool write_deck_list(const std::string& json);
-// Creates the directory with deck_json(sites) and every icon file.
+// Creates the directory with the item list for `sites` (the chosen,
+// administered icon of each, plus a larger other one whose file is never
+// written, so that a wrong icon choice shows as a missing icon) and every
+// icon file.
 bool write_deck(const std::vector<DeckSite>& sites);
 // Three small sites with distinct images (RGBA, RGB and palette).
 std::vector<DeckSite> small_deck();

@@ -10,7 +10,8 @@
 #include "support/db_session.h"
 #include "support/temp_root.h"
 
-std::string server_list_xml(const std::vector<ServerEntry>& servers) {
+// The server list document for `servers`, in order.
+static std::string server_list_xml(const std::vector<ServerEntry>& servers) {
   std::string xml = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<values>\n";
   for (const ServerEntry& s : servers) {
     xml += "  <Server>\n    <Id>" + std::to_string(s.id) + "</Id>\n    <Base-url>" + s.base_url +
@@ -37,20 +38,6 @@ std::string root_file_or_none(const char* fixed_path) {
 
 namespace {
 
-std::string pixel_hex(const std::string& url, bool centre) {
-  std::string where = " FROM site_deck WHERE url = '" + url + "'";
-  std::string size = DbSession::rows("SELECT icon_size" + where);
-  long offset = 0;
-  if (centre) {
-    long width = std::atol(size.c_str());
-    const char* x = std::strchr(size.c_str(), 'x');
-    long height = x != nullptr ? std::atol(x + 1) : 0;
-    offset = ((height / 2) * width + width / 2) * 4;
-  }
-  return DbSession::rows(
-      "SELECT CASE WHEN icon_data IS NULL THEN 'NULL' ELSE hex(substr(icon_data, " +
-      std::to_string(offset + 1) + ", 4)) END" + where);
-}
 
 bool send_int(int fd, int32_t value) {
   return sds_ipc_send_custom_type(fd, &value, sizeof value) == 0;
@@ -75,8 +62,11 @@ bool exchange_initialize(int fd, int cid, double latitude, double longitude, int
 
 }  // namespace
 
-std::string first_pixel_hex(const std::string& url) { return pixel_hex(url, false); }
-std::string centre_pixel_hex(const std::string& url) { return pixel_hex(url, true); }
+std::string first_pixel_hex(const std::string& url) {
+  return DbSession::rows(
+      "SELECT CASE WHEN icon_data IS NULL THEN 'NULL' ELSE hex(substr(icon_data, 1, 4)) END "
+      "FROM site_deck WHERE url = '" + url + "'");
+}
 
 std::string bgra_hex(const char* rgb, const char* alpha) {
   std::string hex = rgb[0] == '#' ? rgb + 1 : rgb;

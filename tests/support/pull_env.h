@@ -14,8 +14,6 @@ struct ServerEntry {
   bool fall_back = false;
 };
 
-// The server list document for `servers`, in order.
-std::string server_list_xml(const std::vector<ServerEntry>& servers);
 // Writes it to the server list file of the root named by $SITEDECK_ROOT.
 bool write_server_list(const std::vector<ServerEntry>& servers);
 
@@ -25,10 +23,9 @@ void set_stall_seconds(int seconds);
 // Content of a file of the root named by $SITEDECK_ROOT, or "<none>".
 std::string root_file_or_none(const char* fixed_path);
 
-// Hex of the first pixel's 4 stored bytes (B,G,R,A) of the site, and of the
-// pixel at the centre of its icon; "NULL" when the site has no icon.
+// Hex of the first pixel's 4 stored bytes (B,G,R,A) of the site; "NULL" when
+// the site has no icon.
 std::string first_pixel_hex(const std::string& url);
-std::string centre_pixel_hex(const std::string& url);
 
 // One colour as the service stores it: "#RRGGBB" and alpha to "BBGGRRAA".
 std::string bgra_hex(const char* rgb, const char* alpha = "FF");

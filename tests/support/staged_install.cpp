@@ -37,14 +37,3 @@ bool systemd_tools_required() {
   return value != nullptr && std::string(value) == "1";
 }
 
-std::string unit_setting(const std::string& text, const std::string& key) {
-  std::stringstream lines(text);
-  std::string line, found;
-  while (std::getline(lines, line)) {
-    if (line.compare(0, key.size() + 1, key + "=") == 0) {
-      if (!found.empty()) found += "\n";
-      found += line.substr(key.size() + 1);
-    }
-  }
-  return found;
-}

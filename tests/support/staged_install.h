@@ -20,6 +20,3 @@ std::string find_program(const char* name);
 // True when SITEDECK_REQUIRE_SYSTEMD_TOOLS is "1".
 bool systemd_tools_required();
 
-// The values of every `key=` line of a unit or configuration `text`, one per
-// line, in order.
-std::string unit_setting(const std::string& text, const std::string& key);

@@ -27,8 +27,11 @@ constexpr size_t kMaxAnnouncement = 256;
 struct CurlCleanup {
   void operator()(CURL* c) const noexcept { curl_easy_cleanup(c); }
 };
-struct SlistFree {
-  void operator()(curl_slist* l) const noexcept { curl_slist_free_all(l); }
+
+// One GET of a control route; never follows redirects.
+struct HttpAnswer {
+  long status = 0;
+  std::string body;
 };
 
 struct Collector {
@@ -96,6 +99,22 @@ bool wait_exit(pid_t pid, int ms) {
   return ready > 0;
 }
 
+HttpAnswer http_get(const std::string& url) {
+  HttpAnswer answer;
+  std::unique_ptr<CURL, CurlCleanup> curl(curl_easy_init());
+  if (!curl) return answer;
+  Collector body{&answer.body, 1024 * 1024};
+  CURL* c = curl.get();
+  curl_easy_setopt(c, CURLOPT_URL, url.c_str());
+  curl_easy_setopt(c, CURLOPT_PROXY, "");
+  curl_easy_setopt(c, CURLOPT_NOSIGNAL, 1L);
+  curl_easy_setopt(c, CURLOPT_TIMEOUT_MS, 10000L);
+  curl_easy_setopt(c, CURLOPT_WRITEFUNCTION, collect);
+  curl_easy_setopt(c, CURLOPT_WRITEDATA, &body);
+  if (curl_easy_perform(c) == CURLE_OK) curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &answer.status);
+  return answer;
+}
+
 void stop_and_reap(pid_t pid) {
   if (pid <= 0) return;
   kill(pid, SIGTERM);
@@ -107,57 +126,6 @@ void stop_and_reap(pid_t pid) {
 
 }  // namespace
 
-std::string HttpAnswer::header(const std::string& name) const {
-  size_t start = 0;
-  while (start < head.size()) {
-    size_t end = head.find('\n', start);
-    if (end == std::string::npos) end = head.size();
-    std::string line = head.substr(start, end - start);
-    if (line.size() > name.size() && line.compare(0, name.size(), name) == 0 &&
-        line[name.size()] == ':') {
-      std::string value = line.substr(name.size() + 1);
-      while (!value.empty() && value.front() == ' ') value.erase(0, 1);
-      while (!value.empty() && (value.back() == '\r' || value.back() == ' ')) value.pop_back();
-      return value;
-    }
-    start = end + 1;
-  }
-  return std::string();
-}
-
-bool HttpAnswer::has_header(const std::string& name) const {
-  return head.compare(0, name.size() + 1, name + ":") == 0 ||
-         head.find("\n" + name + ":") != std::string::npos;
-}
-
-HttpAnswer http_get(const std::string& url, const HttpRequest& request) {
-  HttpAnswer answer;
-  std::unique_ptr<CURL, CurlCleanup> curl(curl_easy_init());
-  if (!curl) return answer;
-  std::unique_ptr<curl_slist, SlistFree> headers;
-  for (const std::string& h : request.headers) {
-    curl_slist* grown = curl_slist_append(headers.get(), h.c_str());
-    if (grown == nullptr) return answer;
-    (void)headers.release();
-    headers.reset(grown);
-  }
-  Collector head{&answer.head, 1024 * 1024};
-  Collector body{&answer.body, request.max_body};
-  CURL* c = curl.get();
-  curl_easy_setopt(c, CURLOPT_URL, url.c_str());
-  curl_easy_setopt(c, CURLOPT_PROXY, "");
-  curl_easy_setopt(c, CURLOPT_NOSIGNAL, 1L);
-  curl_easy_setopt(c, CURLOPT_FOLLOWLOCATION, 0L);
-  curl_easy_setopt(c, CURLOPT_TIMEOUT_MS, request.timeout_ms);
-  curl_easy_setopt(c, CURLOPT_HTTPHEADER, headers.get());
-  curl_easy_setopt(c, CURLOPT_HEADERFUNCTION, collect);
-  curl_easy_setopt(c, CURLOPT_HEADERDATA, &head);
-  curl_easy_setopt(c, CURLOPT_WRITEFUNCTION, collect);
-  curl_easy_setopt(c, CURLOPT_WRITEDATA, &body);
-  answer.curl_code = curl_easy_perform(c);
-  curl_easy_getinfo(c, CURLINFO_RESPONSE_CODE, &answer.status);
-  return answer;
-}
 
 std::string stand_in_signature(const std::string& query, const std::string& key) {
   const std::string text = query + key;
@@ -264,10 +232,4 @@ std::string ContentServerProcess::icon_url(const std::string& file) const {
 GeocoderProcess::GeocoderProcess(const std::vector<std::string>& args)
     : StandInProcess("sitedeck-geocoder", args) {}
 
-std::string GeocoderProcess::base_url() const { return root_url() + "/6.2/reversegeocode.xml"; }
 
-std::string GeocoderProcess::request_url(const std::string& prox, const std::string& app_id,
-                                         const std::string& app_code) const {
-  return base_url() + "?prox=" + prox + "&mode=retrieveAddresses&app_id=" + app_id +
-         "&app_code=" + app_code + "&gen=1";
-}

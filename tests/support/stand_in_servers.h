@@ -2,7 +2,7 @@
 // sitedeck-content-server or sitedeck-geocoder on a kernel-chosen port, read
 // the port from the server's first stdout line (bounded wait), change its
 // fault settings through its control route, read its request counters, and
-// stop and reap it when they go. Also a small blocking HTTP GET for tests.
+// stop and reap it when they go.
 // Settings and counters are listed in docs/stand-in-servers.md.
 #pragma once
 
@@ -12,25 +12,6 @@
 #include <string>
 #include <utility>
 #include <vector>
-
-struct HttpAnswer {
-  int curl_code = -1;  // CURLcode of the transfer; 0 when it completed
-  long status = 0;     // HTTP status, 0 when none was received
-  std::string head;    // every header line as received, status lines included
-  std::string body;    // at most HttpRequest::max_body bytes
-  // Value of the first header line named exactly `name` (case matters), or "".
-  std::string header(const std::string& name) const;
-  bool has_header(const std::string& name) const;
-};
-
-struct HttpRequest {
-  std::vector<std::string> headers;    // extra "Name: value" lines
-  long timeout_ms = 10000;             // whole transfer
-  size_t max_body = 16 * 1024 * 1024;  // a longer body aborts the transfer (CURLE_WRITE_ERROR)
-};
-
-// One GET of `url`; never follows redirects.
-HttpAnswer http_get(const std::string& url, const HttpRequest& request = HttpRequest());
 
 // Lower-case hex MD5 of `query` + `key`: the item-list signature, computed
 // with GLib rather than the service's own routine.
@@ -83,10 +64,4 @@ class ContentServerProcess : public StandInProcess {
 class GeocoderProcess : public StandInProcess {
  public:
   explicit GeocoderProcess(const std::vector<std::string>& args = {});
-  // "http://127.0.0.1:PORT/6.2/reversegeocode.xml"
-  std::string base_url() const;
-  // The full request for a position text such as "37.500000,127.000000".
-  std::string request_url(const std::string& prox,
-                          const std::string& app_id = "Vb7Qm2Lx9Tr4Kp6Ws1Nd",
-                          const std::string& app_code = "Hk3Pz8Rt_Wm5Yc2Nq7Lv4J") const;
 };
