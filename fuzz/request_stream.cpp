@@ -1,19 +1,11 @@
-// Fuzz target: bytes a client sends on its connection, from the first request
-// header on, through the real request loop (__sds_handle_client_request and
-// the dispatcher) against a scratch database of three items. The client end
-// sends the bytes and shuts down for writing, so every read ends at the end
-// of the stream instead of waiting; the service end does not block on writes
-// and the replies are drained after every request. The handshake has gone
-// before; the shared-memory object is made afresh for every run, as the
-// acceptor makes it for every connection.
-//
-// Two things are redirected for the fuzzer's sake. The shared-memory object's
-// machine-wide name becomes one of this process's own, so that fuzzing never
-// touches a running service's object. And the geocoder and the content
-// server of command 1 are named with a scheme the transfer library refuses at
-// once, so an initialize runs its whole pull without the network (ending
-// with 18) while its request is still built from the fuzzed position and
-// version.
+// Fuzz target: bytes a client sends after the handshake, through the real
+// request loop and dispatcher against a scratch database of three items. The
+// client end shuts down for writing, so every read ends at the end of the
+// stream; the service end does not block on writes and replies are drained
+// after every request. Two things are redirected: the shared-memory name
+// becomes this process's own (never a running service's object), and the
+// geocoder and content server get a scheme the transfer library refuses at
+// once, so an initialize runs its whole pull offline (ending with 18).
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <sys/mman.h>
@@ -29,11 +21,11 @@
 #include "database/sitedeck-service-db-interface.h"
 #include "fuzz_support.h"
 #include "kdb.h"
+#include "pull/sitedeck-service-utils.h"
 #include "serve/sitedeck-service-main.h"
+#include "serve/sitedeck-service-shm.h"
 #include "sitedeck-service-paths.h"
 #include "sitedeck-service-raii.h"
-#include "serve/sitedeck-service-shm.h"
-#include "pull/sitedeck-service-utils.h"
 
 namespace {
 

@@ -85,7 +85,7 @@ TEST_F(JsonReader, HostileDocumentsAreRefusedWhole) {
   EXPECT_EQ(sds_json_guard_check(distinct.data(), distinct.size(), &reason), 0);
 }
 
-TEST_F(JsonReader, WalkStepsOnOddNodesAndMissingArguments) {
+TEST_F(JsonReader, WalkStepsOnOddNodes) {
   load("null");
   EXPECT_EQ(root_.type, SDS_JSON_NONE);
   load(R"({"a": [1, "s"], "neg": -2.5, "s": "text"})");
@@ -98,16 +98,6 @@ TEST_F(JsonReader, WalkStepsOnOddNodesAndMissingArguments) {
   EXPECT_EQ(sds_json_parser_get_member(&array, &child, "x"), -1);
   EXPECT_EQ(child.key, nullptr);
   EXPECT_EQ(sds_json_parser_get_nth(&array, &child, -1), 0);
-  LogCapture log;
-  sds_json_parser_parse_buffer(nullptr, &root_);
-  sds_json_parser_parse_buffer_free_value(nullptr);
-  sds_json_parser_parse_buffer_free(nullptr);
-  sds_parse_json_data(nullptr);
-  std::vector<std::string> lines;
-  for (const LogLine& line : log.lines()) lines.push_back(line.message);
-  EXPECT_EQ(lines, (std::vector<std::string>{"[CRITICAL] Invalid data", "Invalid Input Parameters",
-                                             "Invalid Input Parameters",
-                                             "[CRITICAL] File path is null"}));
 }
 
 std::string item(const std::string& url) { return R"({"site": {"siteUrl": ")" + url + R"("}})"; }
@@ -130,9 +120,10 @@ TEST_F(JsonReader, ListsCutShortByABoundWereStoredAsIfWhole) {
       {R"({"items": [)" + item("a") + ", {}, " + item("c") + "]}",
        "an item element without a body"},
       {"[" + item("a") + "]", "the answer is no JSON object"},
-      {R"({"items": [)", "the answer is no JSON document the reader accepts (malformed, larger "
-                          "than 4194304 bytes, nested deeper than 64 or with too many repeated "
-                          "names)"},
+      {R"({"items": [)",
+       "the answer is no JSON document the reader accepts (malformed, larger "
+       "than 4194304 bytes, nested deeper than 64 or with too many repeated "
+       "names)"},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.reason);
@@ -182,8 +173,7 @@ TEST(GeocoderAnswer, EntitiesNeitherReadFilesNorExpandAndAFailedSaveIsLogged) {
   } cases[] = {
       {"external entity",
        "<!DOCTYPE Search [<!ENTITY leak SYSTEM \"file://" + secret + "\">]>\n<Search>" +
-           data("CountyName", "&leak;") +
-           data("StateName", "State &leak;") + "</Search>",
+           data("CountyName", "&leak;") + data("StateName", "State &leak;") + "</Search>",
        "0 |State "},
       {"entity expansion bomb", bomb + "]><Search>" + data("CountyName", "&e9;") + "</Search>",
        "18 -|-"},
@@ -237,23 +227,6 @@ TEST(ServerList, RewriteCutShortByAFullDiskLostTheWholeServerList) {
             1);
 }
 
-// Decodes from an exactly sized heap copy, so that the address sanitizer
-// catches a read past the end; the pixels, or "refused".
-std::vector<uint8_t> decode(const std::string& png, int* width = nullptr, int* height = nullptr) {
-  auto* copy = static_cast<unsigned char*>(std::malloc(png.size()));
-  std::copy(png.begin(), png.end(), copy);
-  unsigned char* raw = nullptr;
-  int w = 0, h = 0, size = 0;
-  const int result = convert_png_to_raw_data(copy, png.size(), &raw, &w, &h, &size);
-  std::free(copy);
-  if (result != 0) return {};
-  std::vector<uint8_t> bytes(raw, raw + size);
-  std::free(raw);
-  if (width != nullptr) *width = w;
-  if (height != nullptr) *height = h;
-  return bytes;
-}
-
 TEST(Png, EveryColourTypeDecodesToBgraAndPixelsEncodeBackWhole) {
   const struct {
     const char* name;
@@ -283,7 +256,8 @@ TEST(Png, EveryColourTypeDecodesToBgraAndPixelsEncodeBackWhole) {
       image.trns_alpha = {0, 64, 128, 200, 7};
     }
     int width = 0, height = 0;
-    EXPECT_EQ(decode(png_encode_image(image), &width, &height), png_expected_bgra(image));
+    EXPECT_EQ(service_decode_png(png_encode_image(image), &width, &height),
+              png_expected_bgra(image));
     EXPECT_EQ(std::to_string(width) + "x" + std::to_string(height), "9x7");
   }
   // IncompressiblePixelsNoLongerOverrunTheOutputBuffer: pixels that do not
@@ -293,24 +267,10 @@ TEST(Png, EveryColourTypeDecodesToBgraAndPixelsEncodeBackWhole) {
   int size = 0;
   ASSERT_EQ(convert_raw_data_to_png(noise.data(), 64, 64, &png, &size), 0);
   EXPECT_GT(size_t(size), noise.size());
-  EXPECT_EQ(decode(std::string(reinterpret_cast<char*>(png), size)), noise);
+  EXPECT_EQ(service_decode_png(std::string(reinterpret_cast<char*>(png), size)), noise);
   std::free(png);
   EXPECT_EQ(convert_raw_data_to_png(noise.data(), 0, 2, &png, &size), -1);
-  EXPECT_EQ(decode("GIF89a-not-a-png-at-all"), std::vector<uint8_t>{});
-}
-
-TEST(RemoveFile, RemovesOrSaysWhyNot) {
-  TempRoot root;
-  const std::string path = root.path(SDS_IMAGES_DIR "/x.png");
-  ASSERT_TRUE(write_file(path, "x"));
-  LogCapture log;
-  EXPECT_EQ(remove_file(path.c_str()), 0);
-  EXPECT_EQ(remove_file(path.c_str()), -1);
-  EXPECT_EQ(remove_file(nullptr), -1);
-  std::vector<std::string> lines;
-  for (const LogLine& line : log.lines()) lines.push_back(line.message);
-  EXPECT_EQ(lines, (std::vector<std::string>{"Failed to remove file in the path",
-                                             "Failed to remove file Path is invalid"}));
+  EXPECT_EQ(service_decode_png("GIF89a-not-a-png-at-all"), std::vector<uint8_t>{});
 }
 
 }  // namespace

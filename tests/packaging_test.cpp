@@ -8,10 +8,9 @@
 #include <filesystem>
 #include <string>
 
-#include "pull/sitedeck-service-utils.h"
 #include "sitedeck-client-commands.h"
 #include "sitedeck-service-paths.h"
-#include "sitedeck-service-raii.h"
+#include "support/png_maker.h"
 #include "support/seeded_deck.h"
 #include "support/service_harness.h"
 #include "support/staged_install.h"
@@ -21,7 +20,6 @@
 namespace {
 
 namespace fs = std::filesystem;
-
 
 // A program built out of this tree against the installed client library
 // (with pkg-config and with find_package) lists the deck of the installed
@@ -64,14 +62,7 @@ TEST(Packaging, ClientProgramBuiltOutOfTreeListsTheDeckAndSavesAnIcon) {
     EXPECT_EQ(result.exit_code, 0) << result.err;
     EXPECT_EQ(result.out, "7\tNews\thttps://news.example/\n3\tMail\thttps://mail.example/\n");
     EXPECT_EQ(std::distance(fs::directory_iterator(out), {}), 1);
-    const std::string png = read_file(out + "/7.png");
-    unsigned char* raw = nullptr;
-    int width = 0, height = 0, size = 0;
-    ASSERT_EQ(convert_png_to_raw_data(reinterpret_cast<const unsigned char*>(png.data()),
-                                      png.size(), &raw, &width, &height, &size),
-              0);
-    UniqueMalloc<unsigned char> pixels(raw);
-    EXPECT_EQ(std::vector<uint8_t>(raw, raw + size), seed_pixels(4, 3, 7));
+    EXPECT_EQ(service_decode_png(read_file(out + "/7.png")), seed_pixels(4, 3, 7));
   }
   int status = 0;
   ASSERT_TRUE(activated.signal(SIGTERM) && activated.wait_exit(&status));
@@ -164,11 +155,11 @@ TEST(Soak, RequestsAndConnectionsLeaveDescriptorsAndMappingsFlatAndNothingBehind
       int32_t seconds = 0;
       sds_client_icon icon;
       sds_client_ids ids;
-      const bool right =
-          n % 4 == 0   ? sds_client_get_url(c, id, &url) == 0
-          : n % 4 == 1 ? sds_client_get_icon(c, id, &icon) == 0 && icon.width == 57
-          : n % 4 == 2 ? sds_client_get_next_update_duration(c, &seconds) == 0
-                       : sds_client_get_ids_by_dirty(c, 1, &ids) == 0 && ids.count == 1001;
+      const bool right = n % 4 == 0   ? sds_client_get_url(c, id, &url) == 0
+                         : n % 4 == 1 ? sds_client_get_icon(c, id, &icon) == 0 && icon.width == 57
+                         : n % 4 == 2
+                             ? sds_client_get_next_update_duration(c, &seconds) == 0
+                             : sds_client_get_ids_by_dirty(c, 1, &ids) == 0 && ids.count == 1001;
       failures += right ? 0 : 1;
       // The first requests settle the database pages and the libraries' caches.
       if (round == 0 && n == 199) settled = proc_stats(services[0]);

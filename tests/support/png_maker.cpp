@@ -6,6 +6,8 @@
 #include <cstring>
 #include <fstream>
 
+#include "pull/sitedeck-service-utils.h"
+
 namespace {
 
 struct ByteSink {
@@ -96,34 +98,16 @@ int encode(EncodeState* state) {
   return 0;
 }
 
+// Scales a sample to 8 bits as libpng does: 16 bits lose their low byte,
+// fewer bits are replicated (a 1-bit 1 becomes 255).
 uint8_t expand_to_8(uint16_t value, int depth) {
-  switch (depth) {
-    case 1:
-      return value ? 255 : 0;
-    case 2:
-      return uint8_t(value * 0x55);
-    case 4:
-      return uint8_t(value * 0x11);
-    case 8:
-      return uint8_t(value);
-    default:
-      return uint8_t(value >> 8);
-  }
+  return depth == 16 ? uint8_t(value >> 8) : uint8_t(value * 255 / ((1 << depth) - 1));
 }
 
 }  // namespace
 
 int png_channels(int color_type) {
-  switch (color_type) {
-    case 2:
-      return 3;
-    case 4:
-      return 2;
-    case 6:
-      return 4;
-    default:
-      return 1;
-  }
+  return color_type == 2 ? 3 : color_type == 4 ? 2 : color_type == 6 ? 4 : 1;
 }
 
 void png_fill(PngImage& image, const std::function<uint16_t(int, int, int)>& sample) {
@@ -205,40 +189,37 @@ std::vector<uint8_t> png_expected_bgra(const PngImage& image) {
   for (size_t p = 0; p < size_t(image.width) * image.height; ++p) {
     const uint16_t* s = image.samples.data() + p * channels;
     uint8_t r, g, b, a = 255;
-    switch (image.color_type) {
-      case 0:
-        r = g = b = expand_to_8(s[0], depth);
-        if (image.has_trns && s[0] == image.trns_grey) a = 0;
-        break;
-      case 2:
-        r = expand_to_8(s[0], depth);
-        g = expand_to_8(s[1], depth);
-        b = expand_to_8(s[2], depth);
-        if (image.has_trns && s[0] == image.trns_red && s[1] == image.trns_green &&
-            s[2] == image.trns_blue) {
-          a = 0;
-        }
-        break;
-      case 3:
-        r = image.palette[3 * s[0]];
-        g = image.palette[3 * s[0] + 1];
-        b = image.palette[3 * s[0] + 2];
-        if (image.has_trns && s[0] < image.trns_alpha.size()) a = image.trns_alpha[s[0]];
-        break;
-      case 4:
-        r = g = b = expand_to_8(s[0], depth);
-        a = expand_to_8(s[1], depth);
-        break;
-      default:
-        r = expand_to_8(s[0], depth);
-        g = expand_to_8(s[1], depth);
-        b = expand_to_8(s[2], depth);
-        a = expand_to_8(s[3], depth);
-        break;
+    if (image.color_type == 3) {
+      r = image.palette[3 * s[0]];
+      g = image.palette[3 * s[0] + 1];
+      b = image.palette[3 * s[0] + 2];
+      if (image.has_trns && s[0] < image.trns_alpha.size()) a = image.trns_alpha[s[0]];
+    } else {
+      const bool colour = (image.color_type & 2) != 0, alpha = (image.color_type & 4) != 0;
+      r = expand_to_8(s[0], depth);
+      g = colour ? expand_to_8(s[1], depth) : r;
+      b = colour ? expand_to_8(s[2], depth) : r;
+      if (alpha) a = expand_to_8(s[channels - 1], depth);
+      const bool keyed =
+          colour ? s[0] == image.trns_red && s[1] == image.trns_green && s[2] == image.trns_blue
+                 : s[0] == image.trns_grey;
+      if (image.has_trns && !alpha && keyed) a = 0;
     }
     out.insert(out.end(), {b, g, r, a});
   }
   return out;
+}
+
+std::vector<uint8_t> service_decode_png(const std::string& png, int* width, int* height) {
+  std::vector<unsigned char> copy(png.begin(), png.end());
+  unsigned char* raw = nullptr;
+  int w = 0, h = 0, size = 0;
+  if (convert_png_to_raw_data(copy.data(), copy.size(), &raw, &w, &h, &size) != 0) return {};
+  std::vector<uint8_t> bytes(raw, raw + size);
+  std::free(raw);
+  if (width != nullptr) *width = w;
+  if (height != nullptr) *height = h;
+  return bytes;
 }
 
 std::vector<uint8_t> noise_bytes(size_t count, uint32_t seed) {

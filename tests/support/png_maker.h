@@ -46,5 +46,11 @@ bool png_write_file(const std::string& path, const PngImage& image);
 // The B,G,R,A bytes the service's decoder gives for `image`, row by row.
 std::vector<uint8_t> png_expected_bgra(const PngImage& image);
 
+// What the service's own decoder makes of `png`: B,G,R,A rows, empty when it
+// refuses it. It reads an exactly sized heap copy, so that the address
+// sanitizer catches a read past the end.
+std::vector<uint8_t> service_decode_png(const std::string& png, int* width = nullptr,
+                                        int* height = nullptr);
+
 // Deterministic pseudo-random bytes (for images that do not compress).
 std::vector<uint8_t> noise_bytes(size_t count, uint32_t seed);

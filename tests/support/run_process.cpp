@@ -21,11 +21,9 @@ int left_ms(std::chrono::steady_clock::time_point deadline) {
 
 ProcessResult run_process(const std::vector<std::string>& argv, int timeout_ms) {
   ProcessResult result;
-  int out_pipe[2], err_pipe[2];
-  if (pipe2(out_pipe, O_CLOEXEC) != 0) return result;
-  if (pipe2(err_pipe, O_CLOEXEC) != 0) {
-    (void)close(out_pipe[0]);
-    (void)close(out_pipe[1]);
+  int out_pipe[2] = {-1, -1}, err_pipe[2] = {-1, -1};
+  if (pipe2(out_pipe, O_CLOEXEC) != 0 || pipe2(err_pipe, O_CLOEXEC) != 0) {
+    for (int fd : {out_pipe[0], out_pipe[1]}) (void)close(fd);
     return result;
   }
   // Built before fork: only async-signal-safe calls may follow it.
