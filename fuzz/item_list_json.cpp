@@ -49,29 +49,15 @@ void set_up(void) {
   std::free(png);
 }
 
-std::set<std::string> live_urls(void) {
-  std::set<std::string> urls;
+// The URLs of the rows `sql` selects.
+std::set<std::string> urls(const char* sql) {
+  std::set<std::string> found;
   sqlite3_stmt* stmt = nullptr;
-  if (sqlite3_prepare_v2(sds_db_handle, "SELECT url FROM site_deck WHERE is_dirty=1", -1, &stmt,
-                         nullptr) != SQLITE_OK) {
-    std::abort();
-  }
+  if (sqlite3_prepare_v2(sds_db_handle, sql, -1, &stmt, nullptr) != SQLITE_OK) std::abort();
   while (sqlite3_step(stmt) == SQLITE_ROW) {
     const unsigned char* url = sqlite3_column_text(stmt, 0);
-    urls.insert(url != nullptr ? reinterpret_cast<const char*>(url) : "(null)");
+    found.insert(url != nullptr ? reinterpret_cast<const char*>(url) : "(null)");
   }
-  sqlite3_finalize(stmt);
-  return urls;
-}
-
-bool has_row(const std::string& url) {
-  sqlite3_stmt* stmt = nullptr;
-  if (sqlite3_prepare_v2(sds_db_handle, "SELECT 1 FROM site_deck WHERE url=?", -1, &stmt,
-                         nullptr) != SQLITE_OK) {
-    std::abort();
-  }
-  sqlite3_bind_text(stmt, 1, url.c_str(), -1, SQLITE_TRANSIENT);
-  bool found = sqlite3_step(stmt) == SQLITE_ROW;
   sqlite3_finalize(stmt);
   return found;
 }
@@ -104,11 +90,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   (void)std::remove(g_icon_path.c_str());
   if (merged == SDS_MERGE_NOT_COMMITTED) return 0;
 
+  const std::set<std::string> stored = urls("SELECT url FROM site_deck");
   std::set<std::string> expected;
   for (const auto& [url, removed] : removed_by_url) {
-    if (!has_row(url)) std::abort();
+    if (stored.count(url) == 0) std::abort();
     if (!removed) expected.insert(url);
   }
-  if (live_urls() != expected) std::abort();
+  if (urls("SELECT url FROM site_deck WHERE is_dirty=1") != expected) std::abort();
   return 0;
 }

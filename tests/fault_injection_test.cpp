@@ -61,6 +61,11 @@ class FaultInjection : public ::testing::Test, public PullRig {
          p = p.parent_path()) {
       ASSERT_EQ(chmod(p.c_str(), 0755), 0) << p;
     }
+    // Only ownership grants writing, whatever umask made the tree.
+    for (const auto& entry : fs::recursive_directory_iterator(path(SDS_DATA_DIR))) {
+      fs::permissions(entry.path(), fs::perms::group_write | fs::perms::others_write,
+                      fs::perm_options::remove);
+    }
     for (const char* fixed : writable) {
       for (const auto& entry : fs::recursive_directory_iterator(path(fixed))) {
         ASSERT_EQ(chown(entry.path().c_str(), kNobody, kNobody), 0);

@@ -96,8 +96,8 @@ class DeckCommands : public ::testing::Test {
     SeedItem three = seed_item(3, "https://three.example/", "Three", 3);
     three.touch_icon_exists = 1;
     three.is_dirty = -1;
-    SeedItem four =
-        seed_item(4, "https://four.example/" + std::string(4979, 'u'), std::string(5000, 't'), 4);
+    SeedItem four = seed_item(4, "https://four.example/" + std::string(4979, 'u'),
+                              std::string(5000, 't'), 4);
     four.is_dirty = 0;
     SeedItem big = seed_item(5, "https://big.example/", "Big", 5);
     big.icon_size = "1024x769";
@@ -280,8 +280,7 @@ TEST(SharedMemoryName, ForeignThingsAtTheNameFailedEveryHandshake) {
       {"directory", [] { return mkdir(SDS_SHM_FILE_PATH, 0777); }},
       {"FIFO", [] { return mkfifo(SDS_SHM_FILE_PATH, 0666); }},
       {"symlink", [&] { return symlink(target.c_str(), SDS_SHM_FILE_PATH); }},
-      {"object of another account",
-       [&] {
+      {"object of another account", [&] {
          UniqueFd made(shm_open(SDS_SHM_NAME, O_RDWR | O_CREAT, 0666));
          bool foreign = restore.before.empty() ||  // else a plain object
                         (fchown(made.get(), nobody->pw_uid, nobody->pw_gid) == 0 &&
@@ -359,8 +358,8 @@ TEST_F(ConnectionBounds, HalfSentRequestHeldTheConnectionForEver) {
   EXPECT_EQ(read_bytes(fd(), 4), words({0}));  // and no position follows
   EXPECT_TRUE(stream_ends(fd()));
   EXPECT_EQ(exit_code(service_), 0) << service_.output();
-  EXPECT_TRUE(
-      service_.has_message_matching("\\[ERROR\\] cmd 1 not complete within 200 ms sock:[0-9]+"));
+  EXPECT_TRUE(service_.has_message_matching(
+      "\\[ERROR\\] cmd 1 not complete within 200 ms sock:[0-9]+"));
 }
 
 // A client that sent requests and never read the replies blocked the
@@ -440,13 +439,17 @@ TEST(IpcTest, BadArgumentsAreRefusedLoggedAndSendNothing) {
       {[&] { return sds_ipc_recv(-1, buffer, 4, "probe"); }, -1, "[ERROR] probe check sock:-1"},
       {[&] { return sds_ipc_recv(s, nullptr, 4, "probe"); }, -1,
        format("[ERROR] probe check buffer sock:%d", s)},
+      {[&] { return sds_ipc_send_custom_type(s, nullptr, 4); }, -1, at("buffer")},
       {[&] { return sds_ipc_send_string(s, nullptr); }, -1, at("buffer")},
+      {[&] { return sds_ipc_read_blob(s, nullptr, 4); }, -1, at("buffer")},
       {[&] { return sds_ipc_read_blob(s, buffer, 0); }, -1, at("size:0")},
       {[&] { return sds_ipc_send_string(s, ""); }, -1, at("length:0")},
       {[&] { return sds_ipc_send_string(s, overlong.c_str()); }, -1, at("length:4097")},
       {[&] { return sds_ipc_simple_response(s, &zero); }, 5, at("command(0)")},
       {[] { return errno = EPIPE, sds_ipc_check_stderr(1); }, SDS_ERROR_IO_ERROR,
        format("[EPIPE:%d] Broken Pipe [%s]", EPIPE, strerror(EPIPE))},
+      {[] { return errno = EINTR, sds_ipc_check_stderr(1); }, SDS_ERROR_IO_EINTR,
+       format("[EINTR:%d] [%s]", EINTR, strerror(EINTR))},
       {[] { return errno = ENOENT, sds_ipc_check_stderr(9); }, 9,
        format("[errno:%d] [%s]", ENOENT, strerror(ENOENT))},
   };
@@ -470,9 +473,8 @@ TEST(ServingReplies, ReplyToAGonePeerWasTriedAndLoggedItemByItem) {
   DbSession db;
   (void)shm_unlink(SDS_SHM_NAME);
   ASSERT_EQ(sds_alloc_shm(), 1);
-  ASSERT_TRUE(
-      db.exec("INSERT INTO site_deck(id, url, title, touch_icon_exists, icon_size, "
-              "icon_data) VALUES (1, 'https://a.example/', 'A', 1, '1x1', x'10203040')"));
+  ASSERT_TRUE(db.exec("INSERT INTO site_deck(id, url, title, touch_icon_exists, icon_size, "
+                      "icon_data) VALUES (1, 'https://a.example/', 'A', 1, '1x1', x'10203040')"));
   const std::function<int(int)> handlers[] = {
       [](int sock) { return _sds_get_string(sock, 1, "url"); },
       [](int sock) { return _sds_get_int(sock, 1, "touch_icon_exists"); },
@@ -594,23 +596,13 @@ TEST_F(ClientTest, InitializeSendsPositionThenVersionAndWaitsOutTheResult) {
     std::string sent;
     bool open_after;
   } cases[] = {
-      {"version, result after two ticks",
-       words({0, 0}),
-       "1.2.3",
-       {0, 2, -1, 17},
-       17,
-       header + words({0, 5}) + "1.2.3",
-       true},
+      {"version, result after two ticks", words({0, 0}), "1.2.3", {0, 2, -1, 17}, 17,
+       header + words({0, 5}) + "1.2.3", true},
       {"no version", words({0, 0, 0}), nullptr, {}, 0, header + words({6}), true},
       {"empty version", words({0, 0, 0}), "", {}, 0, header + words({6}), true},
       {"status 15 first", words({15}), "9", {}, 15, header.substr(0, 12), true},
-      {"gave up waiting",
-       words({0, 0}),
-       nullptr,
-       {0, 0, -1, 0, false},
-       SDS_ERROR_IO_EINTR,
-       header + words({6}),
-       false},
+      {"gave up waiting", words({0, 0}), nullptr, {0, 0, -1, 0, false}, SDS_ERROR_IO_EINTR,
+       header + words({6}), false},
       {"overlong version", "", overlong.c_str(), {}, SDS_ERROR_INVALID_PARAMETER, "", true},
   };
   for (auto c : cases) {

@@ -115,39 +115,27 @@ TEST_F(SitedeckTool, EveryCommandPrintsExactlyWhatTheServiceHolds) {
     enum { kExact, kJson, kHas } match = kExact;
   } cases[] = {
       {{"list"}, 0, list, ""},
-      {{"show", "7"},
-       0,
+      {{"show", "7"}, 0,
        "id:                7\nurl:               https://news.example/\ntitle:             News\n"
        "dominant colour:   #AA0000\nicon size:         4x3\ntouch icon exists: 1\n"
-       "favicon exists:    1\nicon pixels:       4x3, 48 bytes\n",
-       ""},
-      {{"show", "3"},
-       0,
+       "favicon exists:    1\nicon pixels:       4x3, 48 bytes\n", ""},
+      {{"show", "3"}, 0,
        "id:                3\nurl:               https://mail.example/inbox\n"
        "title:             Mail?]2;x?\n"
        "dominant colour:   (none)\nicon size:         (none)\ntouch icon exists: 0\n"
-       "favicon exists:    0\nicon pixels:       (none)\n",
-       ""},
+       "favicon exists:    0\nicon pixels:       (none)\n", ""},
       {{"--json", "list"}, 0, json_list, "", Case::kJson},
-      {{"show", "7", "--json"},
-       0,
-       news + R"(, "icon": {"width": 4, "height": 3, "bytes": 48}})",
-       "",
-       Case::kJson},
+      {{"show", "7", "--json"}, 0, news + R"(, "icon": {"width": 4, "height": 3, "bytes": 48}})",
+       "", Case::kJson},
       {{"--json", "show", "3"}, 0, mail + R"(, "icon": null})", "", Case::kJson},
       {{"--color=always", "list"}, 0, "\033[48;2;170;0;0m  \033[0m #AA0000", "", Case::kHas},
-      {{"show", "7", "--color", "always"},
-       0,
-       "\033[1mdominant colour:\033[0m   \033[48;2;170;0;0m",
-       "",
-       Case::kHas},
+      {{"show", "7", "--color", "always"}, 0,
+       "\033[1mdominant colour:\033[0m   \033[48;2;170;0;0m", "", Case::kHas},
       {{"next-update"}, 0, "7200\n", ""},
       {{"--json", "next-update"}, 0, R"({"seconds": 7200})", "", Case::kJson},
       {{"icon", "7", "-o", png}, 0, png + ": 4x3, ", "", Case::kHas},
       {{"show", "99"}, 1, "", not_found},
-      {{"icon", "3", "-o", none},
-       1,
-       "",
+      {{"icon", "3", "-o", none}, 1, "",
        answered + "6 SDS_ERROR_NO_DATA: nothing is stored for this request\n"},
       {{"render", page}, 0, page + "/index.html\n", ""},
       {{"render", page}, 0, page + "/index.html\n", ""},  // written again, whole
@@ -284,13 +272,11 @@ TEST_F(SitedeckToolMessages, AnUnreachableServiceIsNamedWithTheReasonAndExitsWit
       {kFull,
        unreachable + ": connecting to the service timed out (Resource temporarily unavailable)\n"},
       {kHangsUp, unreachable + ": the service closed the connection before its greeting\n"},
-      {kRefuses,
-       "sitedeck: the service refused the connection: 2 SDS_ERROR_SHM_FAILED: the "
-       "shared-memory object for icon pixels could not be created, mapped or removed\n"},
+      {kRefuses, "sitedeck: the service refused the connection: 2 SDS_ERROR_SHM_FAILED: the "
+                 "shared-memory object for icon pixels could not be created, mapped or removed\n"},
       {kAnswers,
        "sitedeck: lost the connection to the service: 1 SDS_ERROR_IO_ERROR: a socket read or "
-       "write failed or the connection was closed\n",
-       1},
+       "write failed or the connection was closed\n", 1},
       {kAnswers, answered + "9 SDS_ERROR_UNKNOWN: a status number the service does not use\n", 9},
   };
   for (const auto& c : cases) {
@@ -390,6 +376,7 @@ TEST_F(SitedeckToolMessages, OutputThatCannotBeWrittenExitsWithOne) {
   EXPECT_NE(service("--help").find("started by its socket unit"), std::string::npos);
 }
 
+
 constexpr char kPullEnded[] = "1765051200";  // 2025-12-06 20:00:00 UTC
 
 // Size and modification time of every file below `dir`.
@@ -485,8 +472,7 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
       "last_pull": {"time": 1765051200, "status": 0, "name": "SDS_ERROR_NONE"},
       "next_due": 1765054800, "permission_denied": [],
       "location": {"position": "37.500000,127.000000", "city": "Jongno-gu", "province": "Seoul"},
-      "database": {"path": ")" + root_.path(SDS_DB_PATH) +
-                                           R"(", "live_items": 2,
+      "database": {"path": ")" + root_.path(SDS_DB_PATH) + R"(", "live_items": 2,
                    "withdrawn_items": 1, "modified": 1577836800, "age_seconds": 1}})"));
   ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
   ASSERT_EQ(chmod(root_.path(SDS_SERVER_DIR).c_str(), 0), 0);
@@ -499,9 +485,9 @@ TEST_F(SitedeckStatus, SeededRootShowsEveryStoredFactAndChangesNothing) {
         "last position:  permission denied\n"}) {
     EXPECT_NE(result.out.find(line), std::string::npos) << line << "\n" << result.out;
   }
-  EXPECT_EQ(result.err,
-            "sitedeck: status: permission denied: 5 file(s) under " + data_ +
-                " cannot be read by this user (first: " + root_.path(SDS_SERVER_DATA_XML) + ")\n");
+  EXPECT_EQ(result.err, "sitedeck: status: permission denied: 5 file(s) under " + data_ +
+                            " cannot be read by this user (first: " +
+                            root_.path(SDS_SERVER_DATA_XML) + ")\n");
 }
 
 // Missing or broken files are told, not failures (the broken last-pull record
@@ -536,12 +522,14 @@ TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
     ProcessResult result = Status();
     EXPECT_EQ(result.exit_code, 0) << result.err;
     EXPECT_EQ(result.err, "");
-    EXPECT_EQ(result.out,
-              "data directory: " + data_ + "\nservers:        none (no usable server list at " +
-                  root_.path(SDS_SERVER_DATA_XML) + ")\nstored ETag:    none\n" +
-                  "next update:    " + c.next_update + " (86400 s is used)\n" + "last pull:      " +
-                  c.last_pull + "\n" + "last position:  none\nitems:          none\n" +
-                  "database:       no database at " + root_.path(SDS_DB_PATH) + c.database + "\n");
+    EXPECT_EQ(result.out, "data directory: " + data_ +
+                              "\nservers:        none (no usable server list at " +
+                              root_.path(SDS_SERVER_DATA_XML) + ")\nstored ETag:    none\n" +
+                              "next update:    " + c.next_update + " (86400 s is used)\n" +
+                              "last pull:      " + c.last_pull + "\n" +
+                              "last position:  none\nitems:          none\n" +
+                              "database:       no database at " + root_.path(SDS_DB_PATH) +
+                              c.database + "\n");
     result = Status({"--json"});
     EXPECT_TRUE(IsStatusJson(result.out, R"({"data_directory": ")" + data_ +
                                              R"(", "servers": null, "etag": null, "location": null,
@@ -559,6 +547,7 @@ TEST_F(SitedeckStatus, EmptyRootAndBrokenFilesAnswerNoneAndCreateNothing) {
             "sitedeck: status: no data directory at " + data_ + " (is the service installed?)\n");
 }
 
+
 // A tile with stored pixels as the service keeps them after downloading `icon`.
 SeedItem tile(int id, int order, const char* url, std::optional<std::string> title,
               const char* color, const PngImage* icon = nullptr) {
@@ -572,6 +561,7 @@ SeedItem tile(int id, int order, const char* url, std::optional<std::string> tit
   }
   return item;
 }
+
 
 TEST(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
   constexpr char kChromium[] = "/usr/bin/chromium";
@@ -599,11 +589,12 @@ TEST(RenderTool, BrowserShowsTheLiveTilesInServerOrder) {
   ASSERT_EQ(rendered.exit_code, 0) << rendered.err << service.output();
   EXPECT_EQ(rendered.out + rendered.err, page + "\n");
   // The virtual time budget lets the page load and decode, in the browser's own clock.
-  ProcessResult dom = run_process({kChromium, "--headless", "--no-sandbox", "--disable-gpu",
-                                   "--no-first-run", "--user-data-dir=" + root.dir() + "/profile",
-                                   "--disable-extensions", "--disable-background-networking",
-                                   "--virtual-time-budget=10000", "--dump-dom", "file://" + page},
-                                  120000);
+  ProcessResult dom = run_process(
+      {kChromium, "--headless", "--no-sandbox", "--disable-gpu", "--no-first-run",
+       "--user-data-dir=" + root.dir() + "/profile", "--disable-extensions",
+       "--disable-background-networking", "--virtual-time-budget=10000", "--dump-dom",
+       "file://" + page},
+      120000);
   ASSERT_EQ(dom.exit_code, 0) << dom.err;
   EXPECT_NE(dom.out.find("<body data-ready=\"\">"), std::string::npos) << dom.out;
   // No pull has stored a list in this root; the one withdrawn site is left out.

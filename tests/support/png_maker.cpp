@@ -110,18 +110,6 @@ int png_channels(int color_type) {
   return color_type == 2 ? 3 : color_type == 4 ? 2 : color_type == 6 ? 4 : 1;
 }
 
-void png_fill(PngImage& image, const std::function<uint16_t(int, int, int)>& sample) {
-  int channels = png_channels(image.color_type);
-  uint32_t mask = (1u << image.bit_depth) - 1;
-  image.samples.assign(size_t(image.width) * image.height * channels, 0);
-  size_t i = 0;
-  for (int y = 0; y < image.height; ++y) {
-    for (int x = 0; x < image.width; ++x) {
-      for (int c = 0; c < channels; ++c) image.samples[i++] = uint16_t(sample(x, y, c) & mask);
-    }
-  }
-}
-
 PngImage png_pattern(int width, int height, int color_type, int bit_depth, bool interlaced) {
   PngImage image;
   image.width = width;
@@ -137,11 +125,18 @@ PngImage png_pattern(int width, int height, int color_type, int bit_depth, bool 
       image.palette.push_back(uint8_t(i * 11 + 40));
     }
   }
-  png_fill(image, [bit_depth](int x, int y, int c) -> uint16_t {
-    uint32_t v = uint32_t(x * 37 + y * 101 + c * 59 + 11);
-    // 16-bit samples spread over both bytes, so that stripping is visible.
-    return uint16_t(bit_depth == 16 ? v * 263 : v);
-  });
+  // Every sample differs with x, y and channel; 16-bit samples spread over
+  // both bytes, so that stripping is visible.
+  const int channels = png_channels(color_type);
+  const uint32_t mask = (1u << bit_depth) - 1;
+  for (int y = 0; y < height; ++y) {
+    for (int x = 0; x < width; ++x) {
+      for (int c = 0; c < channels; ++c) {
+        const uint32_t v = uint32_t(x * 37 + y * 101 + c * 59 + 11);
+        image.samples.push_back(uint16_t((bit_depth == 16 ? v * 263 : v) & mask));
+      }
+    }
+  }
   return image;
 }
 

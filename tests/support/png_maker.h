@@ -5,7 +5,6 @@
 #pragma once
 
 #include <cstdint>
-#include <functional>
 #include <string>
 #include <vector>
 
@@ -30,10 +29,6 @@ struct PngImage {
 
 // Samples per pixel of a PNG colour type (a palette index counts as one).
 int png_channels(int color_type);
-
-// Fills `image.samples` by calling `sample(x, y, channel)` for every sample;
-// values are masked to the bit depth.
-void png_fill(PngImage& image, const std::function<uint16_t(int x, int y, int c)>& sample);
 
 // A pattern image: every sample differs with x, y and channel. A palette
 // image gets a 2^depth entry palette (at most 256) with distinct colours.

@@ -9,15 +9,11 @@
 
 #include <chrono>
 
-namespace {
-
-int left_ms(std::chrono::steady_clock::time_point deadline) {
+int ms_left(std::chrono::steady_clock::time_point deadline) {
   auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
       deadline - std::chrono::steady_clock::now());
   return left.count() > 0 ? static_cast<int>(left.count()) : 0;
 }
-
-}  // namespace
 
 ProcessResult run_process(const std::vector<std::string>& argv, int timeout_ms) {
   ProcessResult result;
@@ -55,7 +51,7 @@ ProcessResult run_process(const std::vector<std::string>& argv, int timeout_ms) 
   int open_pipes = 2;
   bool over_time = false;
   while (open_pipes > 0) {
-    int ready = poll(fds, 2, left_ms(deadline));
+    int ready = poll(fds, 2, ms_left(deadline));
     if (ready == 0) {
       over_time = true;
       break;
@@ -82,7 +78,7 @@ ProcessResult run_process(const std::vector<std::string>& argv, int timeout_ms) 
   int pidfd = static_cast<int>(syscall(SYS_pidfd_open, pid, 0));
   if (!over_time && pidfd >= 0) {
     struct pollfd entry = {pidfd, POLLIN, 0};
-    over_time = poll(&entry, 1, left_ms(deadline)) != 1;
+    over_time = poll(&entry, 1, ms_left(deadline)) != 1;
   }
   if (pidfd >= 0) (void)close(pidfd);
   if (over_time) (void)kill(pid, SIGKILL);

@@ -3,6 +3,7 @@
 // (the program is killed when it runs over).
 #pragma once
 
+#include <chrono>
 #include <string>
 #include <vector>
 
@@ -12,6 +13,9 @@ struct ProcessResult {
   std::string out;
   std::string err;
 };
+
+// Milliseconds until `deadline`, 0 once it has passed: a poll's time-out.
+int ms_left(std::chrono::steady_clock::time_point deadline);
 
 // `argv[0]` is the program's path; the environment is the test's own.
 ProcessResult run_process(const std::vector<std::string>& argv, int timeout_ms = 20000);

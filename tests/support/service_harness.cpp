@@ -21,6 +21,7 @@
 #include <sstream>
 
 #include "sitedeck-service-paths.h"
+#include "support/run_process.h"
 #include "support/temp_root.h"
 
 extern char** environ;
@@ -41,12 +42,6 @@ void format_pid(char* out, pid_t value) {
   } while (value > 0 && n < 15);
   while (n > 0) *out++ = digits[--n];
   *out = '\0';
-}
-
-int remaining_ms(std::chrono::steady_clock::time_point deadline) {
-  auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-      deadline - std::chrono::steady_clock::now());
-  return left.count() > 0 ? static_cast<int>(left.count()) : 0;
 }
 
 }  // namespace
@@ -167,7 +162,7 @@ bool ServiceHarness::wait_until_accepting(int timeout_ms) {
     std::ifstream in(path);
     long number = -1;
     if (in >> number && (number == SYS_accept || number == SYS_accept4)) return true;
-    int left = remaining_ms(deadline);
+    int left = ms_left(deadline);
     if (left == 0) return false;
     // Waiting on the pidfd paces the checks and notices an early exit at once.
     struct pollfd entry = {pidfd_, POLLIN, 0};

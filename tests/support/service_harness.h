@@ -1,11 +1,8 @@
 // Runs the real service binary for end-to-end tests, in the TempRoot named by
-// $SITEDECK_ROOT: under the activator as on a device, directly with a
-// listening socket passed as descriptor 3 (the harness doing the activation
-// itself), or without any activation. Every wait is bounded and event-driven:
-// readiness through a pipe, process ends through a pidfd. The process's
-// standard error (the service's log lines) is kept in a file of the root.
-// The destructor stops whatever still runs and removes the machine-wide
-// shared-memory object the service creates.
+// $SITEDECK_ROOT: under the activator, directly with a listening socket as
+// descriptor 3, or unactivated. Every wait is bounded (a ready pipe, a pidfd);
+// the log lines are kept in a file of the root; the destructor stops what
+// still runs and removes the machine-wide shared-memory object.
 #pragma once
 
 #include <sys/types.h>

@@ -16,6 +16,8 @@
 #include <cstdlib>
 #include <memory>
 
+#include "support/run_process.h"
+
 extern char** environ;
 
 namespace {
@@ -47,20 +49,11 @@ size_t collect(char* data, size_t size, size_t count, void* user) {
   return bytes;
 }
 
+// Everything but the unreserved characters escaped, as a query value needs.
 std::string percent_encode(const std::string& text) {
-  static const char kHex[] = "0123456789ABCDEF";
-  std::string out;
-  for (unsigned char c : text) {
-    const bool plain = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
-                       c == '-' || c == '_' || c == '.' || c == '~';
-    if (plain) {
-      out.push_back(static_cast<char>(c));
-    } else {
-      out.push_back('%');
-      out.push_back(kHex[c >> 4]);
-      out.push_back(kHex[c & 15]);
-    }
-  }
+  gchar* escaped = g_uri_escape_string(text.c_str(), nullptr, FALSE);
+  std::string out = escaped;
+  g_free(escaped);
   return out;
 }
 
@@ -70,11 +63,10 @@ std::string read_announcement(int fd) {
   const auto deadline =
       std::chrono::steady_clock::now() + std::chrono::milliseconds(kStartTimeoutMs);
   while (line.find('\n') == std::string::npos && line.size() < kMaxAnnouncement) {
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-        deadline - std::chrono::steady_clock::now());
-    if (left.count() <= 0) break;
+    const int left = ms_left(deadline);
+    if (left == 0) break;
     pollfd p{fd, POLLIN, 0};
-    const int ready = poll(&p, 1, static_cast<int>(left.count()));
+    const int ready = poll(&p, 1, left);
     if (ready < 0 && errno == EINTR) continue;
     if (ready <= 0) break;
     char buffer[64];

@@ -1,9 +1,6 @@
-// Test harness for the stand-in servers: RAII owners that start
-// sitedeck-content-server or sitedeck-geocoder on a kernel-chosen port, read
-// the port from the server's first stdout line (bounded wait), change its
-// fault settings through its control route, read its request counters, and
-// stop and reap it when they go.
-// Settings and counters are listed in docs/stand-in-servers.md.
+// The stand-in servers as RAII owners: started on a kernel-chosen port (read
+// from their first line), set and counted through their control routes (see
+// docs/stand-in-servers.md), stopped and reaped when they go.
 #pragma once
 
 #include <sys/types.h>
@@ -27,7 +24,6 @@ class StandInProcess {
 
   // False when the binary could not be started or announced no port in 10 s.
   bool ok() const { return port_ > 0; }
-  int port() const { return port_; }
   pid_t pid() const { return pid_; }
   std::string root_url() const;  // "http://127.0.0.1:PORT"
 
