@@ -56,9 +56,9 @@ int main(int argc, char** argv) {
       options.json_path = argv[++i];
     } else if (std::strcmp(argv[i], "--service") == 0 && i + 1 < argc &&
                std::strchr(argv[i + 1], '=') != nullptr && argv[i + 1][0] != '=') {
-      std::string spec = argv[++i];
-      size_t equals = spec.find('=');
-      options.services.push_back({spec.substr(0, equals), spec.substr(equals + 1)});
+      std::string named = argv[++i];
+      size_t equals = named.find('=');
+      options.services.push_back({named.substr(0, equals), named.substr(equals + 1)});
     } else {
       usage(argv[i][1] == 'h' || std::strcmp(argv[i], "--help") == 0 ? stdout : stderr);
       return std::strcmp(argv[i], "--help") == 0 ? 0 : 2;
